@@ -1,0 +1,60 @@
+// The error codes of the system: one unsigned 64-bit number, the same in the daemon, on the wire
+// ("ReplyError") and in the tools. 1 is success; 0 is never used.
+#pragma once
+
+#include <cstdint>
+#include <string_view>
+
+enum TSYErrorCode : uint64_t {
+  TSYErrorSuccess = 1,  // also the code of the few failures that carry no detail
+  TSYErrorMoveToTempFailed = 4,
+  TSYErrorTransientRemoveFailed = 5,
+  TSYErrorCreateDirectoryFailed = 6,
+  TSYErrorStagingCreateFailed = 7,
+  TSYErrorStagingMoveFailed = 8,
+  TSYErrorStagingRemoveFailed = 9,
+  TSYErrorInvalidPath = 10,
+  TSYErrorInvalidObject = 11,
+  TSYErrorReadFailed = 12,
+  TSYErrorReplaceStageOldFailed = 14,
+  TSYErrorReplaceFailed = 15,
+  TSYErrorDestroyFailed = 17,
+  TSYErrorMissingIdentifier = 18,
+  TSYErrorUnexpectedContainerType = 20,
+  TSYErrorNotFound = 21,
+  TSYErrorSameContainer = 22,
+  TSYErrorClassMismatch = 23,
+  TSYErrorInfoValueNotFound = 24,
+  TSYErrorAlreadyExists = 27,
+  TSYErrorDeleteFailed = 28,
+  TSYErrorInvalidMetadata = 29,
+  TSYErrorInvalidReplaceInfo = 33,
+  TSYErrorWriteFailed = 34,
+  TSYErrorReplaceFileInvalid = 35,
+  TSYErrorRemoveFileFailed = 36,
+  TSYErrorInvalidArgument = 38,
+  TSYErrorException = 40,
+  TSYErrorFileOperationFailed = 41,
+  TSYErrorCacheRebuildFailed = 43,
+  TSYErrorCacheInconsistent = 44,
+  TSYErrorCacheAddFailed = 45,
+  TSYErrorCacheRemoveFailed = 46,
+  TSYErrorCacheInvalidInput = 47,
+  TSYErrorUUIDMoveFailed = 48,
+  TSYErrorInvalidCommand = 49,
+  TSYErrorNotEntitled = 55,
+  TSYErrorCountMismatch = 60,
+  TSYErrorLockedNoRetry = 61,
+  TSYErrorChownFailed = 62,
+  TSYErrorACLFailed = 63,
+  TSYErrorStageSharedContentFailed = 64,
+  TSYErrorDatabase = 66,
+  TSYErrorNotFoundInDatabase = 67,
+  TSYErrorDatabaseChangeCount = 68,
+  TSYErrorSuperseded = 69,
+  TSYErrorUserManagedPathNotFound = 71,
+  TSYErrorAllocationFailed = 73,
+  TSYErrorInvalidUserIdentityData = 75,
+  TSYErrorPersonaMismatch = 76,
+  TSYErrorQueueEmpty = 77,  // the command queue ran dry; never reaches a client
+};

@@ -1,0 +1,32 @@
+// The client's end: one connection, one request at a time. Not for use by two threads at once.
+#pragma once
+
+#include <expected>
+#include <string>
+
+#include "Platform/base/FileDescriptor.h"
+#include "Platform/ipc/Codec.h"
+#include "Platform/ipc/Message.h"
+
+namespace platform::ipc {
+
+struct ChannelError {
+  std::string reason;
+};
+
+class Channel {
+ public:
+  // Connects to a service's socket; paths of any length.
+  static std::expected<Channel, ChannelError> connect(const std::string& socketPath);
+
+  // Sends one request and waits for its reply.
+  std::expected<Message, ChannelError> call(const Message& request);
+
+ private:
+  explicit Channel(FileDescriptor socket) : socket_(std::move(socket)) {}
+
+  FileDescriptor socket_;
+  uint32_t lastSequence_ = 0;
+};
+
+}  // namespace platform::ipc

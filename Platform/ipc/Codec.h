@@ -1,0 +1,45 @@
+// Messages as CBOR (RFC 8949), and the 16-byte header of a frame. Docs/protocol.md has the format.
+//
+// The decoder streams: it allocates nothing that the bytes at hand do not justify. Malformed CBOR,
+// a duplicate key, a key that is not text, text that is not UTF-8 or holds a NUL, an unknown tag
+// and nesting deeper than 64 are refused whole. Any thread.
+#pragma once
+
+#include <array>
+#include <cstdint>
+#include <expected>
+#include <span>
+#include <string>
+#include <vector>
+
+#include "Platform/ipc/Message.h"
+
+namespace platform::ipc {
+
+inline constexpr size_t kFrameHeaderSize = 16;
+inline constexpr uint32_t kMaximumBodySize = 16 * 1024 * 1024;
+inline constexpr size_t kMaximumNesting = 64;
+inline constexpr uint32_t kReplyFlag = 1;
+
+struct FrameHeader {
+  uint32_t bodyLength = 0;
+  uint32_t sequence = 0;  // the request's own number; 0: no reply context
+  uint32_t flags = 0;
+};
+
+// Why bytes are no frame or no message. For log lines.
+struct CodecError {
+  std::string reason;
+};
+
+std::array<uint8_t, kFrameHeaderSize> encodeHeader(const FrameHeader& header);
+// Refuses a wrong magic, a length over the limit and unknown flags.
+std::expected<FrameHeader, CodecError> decodeHeader(
+    std::span<const uint8_t, kFrameHeaderSize> bytes);
+
+std::expected<Message, CodecError> decodeMessage(std::span<const uint8_t> body);
+// A whole frame. Refuses a body over the limit.
+std::expected<std::vector<uint8_t>, CodecError> encodeFrame(const Message& message,
+                                                            uint32_t sequence, uint32_t flags);
+
+}  // namespace platform::ipc
