@@ -39,7 +39,8 @@ void TSYLogWrite(int level, TSYLocatedFormat<std::type_identity_t<Arguments>...>
                   fmt::format(format.format, std::forward<Arguments>(arguments)...));
 }
 
-// The categories of the subsystem "com.veltra.tessary"; `daemon` is the one of "com.veltra.tessaryd".
+// The categories of the subsystem "com.veltra.tessary"; `daemon` is the one of
+// "com.veltra.tessaryd".
 enum class TSYChannel {
   unspecified,
   cache,

@@ -17,8 +17,12 @@ struct Errno {
 };
 
 // The calling thread's errno as the failure side of a Result.
-inline std::unexpected<Errno> lastErrno() { return std::unexpected(Errno{errno}); }
-inline std::unexpected<Errno> failWith(int value) { return std::unexpected(Errno{value}); }
+inline std::unexpected<Errno> lastErrno() {
+  return std::unexpected(Errno{errno});
+}
+inline std::unexpected<Errno> failWith(int value) {
+  return std::unexpected(Errno{value});
+}
 
 template <typename T>
 class [[nodiscard]] Result : public std::expected<T, Errno> {

@@ -18,8 +18,8 @@ thread_local const SerialQueue* currentQueue = nullptr;
 thread_local std::deque<const SerialQueue*> outerQueues;
 
 void lowerPriorityOfCallingThread() {
-  constexpr int kWhoProcess = 1;            // IOPRIO_WHO_PROCESS
-  constexpr int kIdleClass = 3 << 13;       // IOPRIO_CLASS_IDLE
+  constexpr int kWhoProcess = 1;       // IOPRIO_WHO_PROCESS
+  constexpr int kIdleClass = 3 << 13;  // IOPRIO_CLASS_IDLE
   constexpr int kBackgroundNiceness = 10;
   const auto thread = static_cast<id_t>(::gettid());
   ::setpriority(PRIO_PROCESS, thread, kBackgroundNiceness);

@@ -43,7 +43,8 @@ struct DirectoryEntry {
   ItemKind kind;
 };
 
-// An item as (open parent directory, name in it).
+// An item as (open parent directory, name in it). The parent is open with O_PATH: good for the
+// ...at() calls and /proc/self/fd, not for reading or fsync.
 struct Place {
   FileDescriptor parent;
   std::string name;
@@ -75,6 +76,16 @@ class FileSystem {
   Result<struct stat> status(const std::string& path) const;
   // Every entry but "." and "..", in the order of the directory. ENOTDIR, ENOENT and so on.
   Result<std::vector<DirectoryEntry>> list(const std::string& directory) const;
+
+  // --- Following links ------------------------------------------------------------------------
+  // The two operations that do, for checks on paths of other people's making. Here a path may hold
+  // "." and "..". The tree below the root is a world of its own: an absolute link starts at the
+  // root, and nothing leads out.
+  //
+  // realpath(3): the absolute path, root included, without any link.
+  Result<std::string> resolve(const std::string& path) const;
+  // readlink(2): the text of a final link, after following those before it. EINVAL for no link.
+  Result<std::string> readLink(const std::string& path) const;
 
   // --- Small files ------------------------------------------------------------------------------
   // The whole content of a regular file; EINVAL when it is none, EFBIG over `limit` bytes.
@@ -152,6 +163,14 @@ class FileSystem {
 
  private:
   FileSystem(std::string root, FileDescriptor descriptor, Privilege privilege);
+
+  // The path below the root's descriptor, "." for the root itself. Points into `path`.
+  Result<const char*> relative(const std::string& path) const;
+  // The same without looking at the components.
+  Result<const char*> relativeWithDots(const std::string& path) const;
+  Result<FileDescriptor> openAt(const std::string& path, int flags) const;
+  Result<void> createFileAt(int parent, const std::string& name, std::span<const uint8_t> bytes,
+                            const WriteOptions& options) const;
 
   std::string root_;
   FileDescriptor rootDescriptor_;

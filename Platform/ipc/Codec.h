@@ -2,7 +2,7 @@
 //
 // The decoder streams: it allocates nothing that the bytes at hand do not justify. Malformed CBOR,
 // a duplicate key, a key that is not text, text that is not UTF-8 or holds a NUL, an unknown tag
-// and nesting deeper than 64 are refused whole. Any thread.
+// and what is over the limits below are refused whole. Any thread.
 #pragma once
 
 #include <array>
@@ -18,7 +18,10 @@ namespace platform::ipc {
 
 inline constexpr size_t kFrameHeaderSize = 16;
 inline constexpr uint32_t kMaximumBodySize = 16 * 1024 * 1024;
+// Arrays and maps inside each other, the body's own map included.
 inline constexpr size_t kMaximumNesting = 64;
+// Values in one message, keys not counted: a byte of CBOR can become a value of 56.
+inline constexpr size_t kMaximumValues = 1024 * 1024;
 inline constexpr uint32_t kReplyFlag = 1;
 
 struct FrameHeader {
@@ -38,7 +41,8 @@ std::expected<FrameHeader, CodecError> decodeHeader(
     std::span<const uint8_t, kFrameHeaderSize> bytes);
 
 std::expected<Message, CodecError> decodeMessage(std::span<const uint8_t> body);
-// A whole frame. Refuses a body over the limit.
+// A whole frame. Refuses what decodeMessage would refuse: a body over one of the limits and text
+// that is not UTF-8 or holds a NUL.
 std::expected<std::vector<uint8_t>, CodecError> encodeFrame(const Message& message,
                                                             uint32_t sequence, uint32_t flags);
 

@@ -28,7 +28,9 @@ class Message {
   const Value::Dictionary* dictionary(std::string_view key) const;
   const Value* value(std::string_view key) const;
 
-  void set(std::string key, Value value) { values_.insert_or_assign(std::move(key), std::move(value)); }
+  void set(std::string key, Value value) {
+    values_.insert_or_assign(std::move(key), std::move(value));
+  }
 
   const Value::Dictionary& values() const { return values_; }
 

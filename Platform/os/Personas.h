@@ -23,6 +23,7 @@ struct PersonaAttributes {
   std::vector<std::string> bundleIdentifiers;
 
   std::string description() const;
+  bool operator==(const PersonaAttributes&) const = default;
 };
 
 class Personas {

@@ -36,7 +36,8 @@ class Sandbox {
   int setContainerPath(const SandboxMappingKey& key, const std::optional<std::string>& path);
 
   // While one lives, what its thread pushes is collected, and its end writes it with one write,
-  // leaving out what cancels itself. For scans that push thousands.
+  // leaving out what cancels itself. For scans that push thousands. Ends on the thread that began
+  // it; one inside another writes its own.
   class Batch {
    public:
     explicit Batch(Sandbox& sandbox);
@@ -44,8 +45,11 @@ class Sandbox {
     Batch(const Batch&) = delete;
     Batch& operator=(const Batch&) = delete;
 
+    struct Pending;
+
    private:
     Sandbox& sandbox_;
+    std::unique_ptr<Pending> pending_;
   };
 
   // A token "class;pid;path;hex": an authenticator over class, audit token and path under a key

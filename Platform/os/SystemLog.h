@@ -14,6 +14,8 @@ class SystemLog {
   // Reads TESSARY_LOG_LEVEL (debug, info, default, error, fault): what is below is dropped.
   // "default" when it is not set.
   SystemLog();
+  // With a threshold of its own, to the journal or to standard error.
+  SystemLog(LogLevel threshold, bool journal);
 
   // Whether a message of this level goes anywhere: ask before formatting. Any thread.
   bool enabled(LogLevel level) const { return level >= threshold_; }

@@ -9,6 +9,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <vector>
 
 #include "Platform/fs/FileSystem.h"
 #include "Platform/os/AuditToken.h"
@@ -25,6 +26,14 @@ struct TaskRecord {
   bool kernelTask = false;
 };
 
+// A process as records are named by it.
+struct TaskProcess {
+  pid_t pid;
+  uint64_t startTime;
+
+  bool isAlive() const;
+};
+
 class Tasks {
  public:
   explicit Tasks(const FileSystem& files);
@@ -34,6 +43,8 @@ class Tasks {
   Result<TaskRecord> record(pid_t pid, uint64_t startTime) const;
   // Writes the record of a process. Called by launchers.
   Result<void> write(pid_t pid, uint64_t startTime, const TaskRecord& record) const;
+  // The processes that have a record, ended ones among them. None without a directory.
+  Result<std::vector<TaskProcess>> processes() const;
   // Removes the records of processes that have ended.
   void removeStale() const;
 

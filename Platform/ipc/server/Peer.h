@@ -23,4 +23,7 @@ struct Peer {
 // for it (ESRCH otherwise). EPERM for a peer of another pid namespace.
 Result<Peer> identifyPeer(int socket, const Tasks& tasks);
 
+// Whether the kernel gives pidfds of peers. Without them a reused pid can be taken for the peer.
+bool kernelHasPeerDescriptors();
+
 }  // namespace platform::ipc

@@ -21,6 +21,7 @@
 #include "Platform/base/SerialQueue.h"
 #include "Platform/ipc/Message.h"
 #include "Platform/ipc/server/Peer.h"
+#include "Platform/os/SystemLog.h"
 
 namespace platform::ipc {
 
@@ -35,6 +36,7 @@ struct Limits {
 };
 
 class ServerConnection;
+class ServerCore;
 
 // The right to answer one request, once. May be kept and used later from any thread; one that is
 // dropped unused sends nothing.
@@ -77,24 +79,28 @@ class Server {
   using Handler = std::function<void(Request request)>;
 
   // Binds `socketPath` (mode 0666, any length, replacing a stale socket) or takes `activated` over
-  // when it is valid. Connections are accepted, and their peers identified, on `acceptQueue`;
-  // `handler` runs on worker threads. All three must outlive the server.
+  // when it is valid (EINVAL when it is no listening stream socket). Connections are accepted, and
+  // their peers identified, on `acceptQueue`; `handler` runs on worker threads. The log, the tasks,
+  // the queue and what the handler refers to must outlive the server, and with the log all handles
+  // and reply ports.
   static Result<std::unique_ptr<Server>> create(const std::string& socketPath,
                                                 FileDescriptor activated, const Tasks& tasks,
-                                                SerialQueue& acceptQueue, Handler handler,
-                                                Limits limits = {});
+                                                const SystemLog& log, SerialQueue& acceptQueue,
+                                                Handler handler, Limits limits = {});
+  // Waits for the handlers that run, then ends all connections. Not on the accept queue, which must
+  // not be suspended, and not on a worker. Reply ports that are left send nothing.
   ~Server();
 
   // Begins to accept. Call it on the accept queue.
   void resume();
   // Accepts nothing more, takes no further request, and waits until the requests that run have
-  // ended and their replies are out, or `timeout` has passed. Returns whether all ended.
+  // ended and their replies are out, or `timeout` has passed. Returns whether all ended. A reply
+  // port that was kept is not waited for; it still works until the server is gone.
   bool drain(std::chrono::milliseconds timeout);
 
  private:
-  struct State;
-  explicit Server(std::shared_ptr<State> state);
-  std::shared_ptr<State> state_;
+  explicit Server(std::shared_ptr<ServerCore> core);
+  std::shared_ptr<ServerCore> core_;
 };
 
 }  // namespace platform::ipc

@@ -1,0 +1,72 @@
+// Death row: what is to be deleted is renamed out of sight first and removed later, by one task at
+// a time on a queue of its own. Nothing on death row is ever read back.
+
+#include "Daemon/TSYClientConnection.h"
+#include "Daemon/TSYDaemonQueues.h"
+#include "Daemon/TSYFileManager.h"
+#include "Daemon/TSYGlobalConfiguration.h"
+#include "Daemon/TSYLog.h"
+
+TSYResult<void> TSYClientConnection::_moveItemAtURLToDeathRow(const TSYURL& url, bool /*isDir*/,
+                                                              bool startDeletionThread) {
+  TSYFileManager& files = TSYFileManager::defaultManager();
+  // A directory of its own keeps items of the same name apart.
+  const auto directory = files.createTemporaryDirectoryInDirectoryURL(
+      TSYGlobalConfiguration::sharedInstance().deathrowDirectory());
+  if (!directory) {
+    return TSYFailure(TSYErrorCreate(TSYErrorFileOperationFailed, directory.error(), TSYLogIt::yes,
+                                     "Failed to create unique directory at: {}", url.path()));
+  }
+  const TSYURL target = directory->appending(url.lastPathComponent());
+  const auto moved = files.moveItemAtURL(url, target);
+  if (!moved) {
+    if (moved.error().isPosix(ENOENT)) return {};
+    return TSYFailure(TSYErrorCreate(TSYErrorFileOperationFailed, moved.error(), TSYLogIt::yes,
+                                     "Failed to move item at: {} to: {}", url.path(),
+                                     target.path()));
+  }
+  if (startDeletionThread) deleteContainersOnDeathRowWithCompletion(nullptr);
+  return {};
+}
+
+void TSYClientConnection::deleteContainersOnDeathRowWithCompletion(
+    std::function<void(uint64_t)> completion) {
+  TSYAsyncKeepingAlive(TSYDeathRowQueue(), [completion = std::move(completion)] {
+    const uint64_t code = emptyDeathRow();
+    if (completion) completion(code);
+  });
+}
+
+uint64_t TSYClientConnection::emptyDeathRow() {
+  const TSYURL deathRow = TSYGlobalConfiguration::sharedInstance().deathrowDirectory();
+  const auto items = TSYFileManager::defaultManager().urlsForItemsInDirectoryAtURL(deathRow);
+  if (!items) {
+    if (items.error().isPosix(ENOENT)) return TSYErrorSuccess;
+    return TSYErrorCreate(TSYErrorDeleteFailed, items.error(), TSYLogIt::yes,
+                          "Failed to get items for deletion: {} : {}", deathRow.path(),
+                          items.error())
+        .code();
+  }
+  uint64_t code = TSYErrorSuccess;
+  for (const TSYURL& item : *items) {
+    const auto removed = _removeItemOrMoveToTempAtURL(item);
+    if (removed) continue;
+    code = TSYErrorCreate(TSYErrorDestroyFailed, removed.error(), TSYLogIt::yes,
+                          "Failed to destroy item at: {}", item.path())
+               .code();
+  }
+  return code;
+}
+
+TSYResult<void> TSYClientConnection::_removeItemOrMoveToTempAtURL(const TSYURL& url) {
+  TSYFileManager& files = TSYFileManager::defaultManager();
+  const auto removed = files.removeItemAtURL(url);
+  if (removed || removed.error().isPosix(ENOENT)) return {};
+  TSYLogWrite(TSYLogLevelDebug, "Couldn't remove, so moving item to /tmp: {} : {}", url.path(),
+              removed.error());
+  const TSYURL temporary = TSYGlobalConfiguration::sharedInstance().temporaryDirectory();
+  const auto moved = files.moveItemAtURL(url, temporary.appending(url.lastPathComponent()));
+  if (moved) return {};
+  return TSYFailure(TSYErrorCreate(TSYErrorMoveToTempFailed, moved.error(), TSYLogIt::yes,
+                                   "Failed to move dir: {} to: {}", url.path(), temporary.path()));
+}

@@ -1,0 +1,34 @@
+// What every installed application and plug-in is entitled to.
+//
+// Its database is not built yet: the mapping knows of no entry, so nobody has a parent, a system
+// container or registered entitlements, and registering a caller is accepted and forgotten.
+//
+// All operations may be called from any thread.
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "Platform/values/Value.h"
+
+class TSYCommandQueue;
+
+class TSYCodeSigningMapping {
+ public:
+  using Entitlements = std::shared_ptr<const platform::Value::Dictionary>;
+
+  static TSYCodeSigningMapping& sharedInstance();
+
+  // Registers what a caller of the daemon is entitled to. What has to be deleted for it is put on
+  // `commandQueue`. Returns a TSYErrorCode.
+  uint64_t processCallerRegisteredEntitlements(const platform::Value::Dictionary& entitlements,
+                                               const std::string& forIdentifier,
+                                               TSYCommandQueue& commandQueue);
+  // Null without an entry.
+  Entitlements entitlementsForIdentifier(const std::string& identifier);
+  bool identifierHasSystemContainer(const std::string& identifier);
+  // The application that a plug-in belongs to.
+  std::optional<std::string> parentIdentifierForChildIdentifier(const std::string& identifier);
+};

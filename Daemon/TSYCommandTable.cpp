@@ -1,0 +1,75 @@
+#include "Daemon/TSYCommandTable.h"
+
+#include "Daemon/TSYCommandHandlers.h"
+#include "Daemon/TSYEntitlements.h"
+
+namespace {
+
+// The three flags of a row, in the order of its fields.
+struct Flags {
+  bool repliesOnReturn;
+  bool allowUnentitled;
+  bool consultsLookup;
+};
+
+constexpr Flags kPlain{true, false, false};
+constexpr Flags kDeferred{false, false, false};
+constexpr Flags kLookup{true, false, true};
+constexpr Flags kUnentitled{true, true, false};
+constexpr Flags kUnentitledLookup{true, true, true};
+
+constexpr TSYCommandRow row(uint64_t command, TSYCommandHandler handler, const char* entitlement,
+                            Flags flags) {
+  return {command,
+          handler,
+          entitlement,
+          flags.repliesOnReturn,
+          flags.allowUnentitled,
+          flags.consultsLookup};
+}
+
+// The operation behind the row is not built yet.
+constexpr TSYCommandHandler kNotBuilt = TSYHandleNotBuilt;
+constexpr const char* kAllowed = kTSYEntitlementAllowed;
+
+constexpr std::array<TSYCommandRow, kTSYCommandCount> kTable = {{
+    row(0, TSYHandleCreateOrLookup, kAllowed, kUnentitledLookup),
+    row(1, TSYHandleContainersOfClass, kAllowed, kLookup),
+    row(2, kNotBuilt, kAllowed, kPlain),
+    row(3, kNotBuilt, kAllowed, kPlain),
+    row(4, kNotBuilt, kTSYEntitlementUserManagedAssets, kDeferred),
+    row(5, kNotBuilt, kAllowed, kPlain),
+    row(6, kNotBuilt, kAllowed, kPlain),
+    row(7, kNotBuilt, kAllowed, kPlain),
+    row(8, kNotBuilt, kAllowed, kPlain),
+    row(9, kNotBuilt, kAllowed, kPlain),
+    row(10, kNotBuilt, kAllowed, kPlain),
+    row(11, kNotBuilt, kTSYEntitlementWipeContainer, kPlain),
+    row(12, kNotBuilt, kTSYEntitlementDeleteContainerContent, kPlain),
+    row(13, kNotBuilt, kAllowed, kUnentitledLookup),
+    row(14, kNotBuilt, kAllowed, kLookup),
+    row(15, TSYHandleSystemContainerPath, kAllowed, kUnentitledLookup),
+    row(16, kNotBuilt, kAllowed, kUnentitledLookup),
+    row(17, kNotBuilt, kAllowed, kUnentitledLookup),
+    row(18, kNotBuilt, kAllowed, kPlain),
+    row(19, kNotBuilt, kAllowed, kPlain),
+    row(20, kNotBuilt, kAllowed, kPlain),
+    row(21, kNotBuilt, kAllowed, kDeferred),
+    row(22, kNotBuilt, kAllowed, kPlain),
+    row(23, kNotBuilt, kAllowed, kLookup),
+    row(24, kNotBuilt, kTSYEntitlementDataMigration, kPlain),
+    row(25, kNotBuilt, kTSYEntitlementTestability, kPlain),
+    row(26, kNotBuilt, kTSYEntitlementStageSharedContent, kPlain),
+    row(27, TSYHandleRetired, kAllowed, kPlain),
+    row(28, kNotBuilt, kTSYEntitlementUserManagedAssets, kUnentitled),
+    row(29, kNotBuilt, kTSYEntitlementUserManagedAssets, kPlain),
+    row(30, kNotBuilt, kAllowed, kPlain),
+    row(31, kNotBuilt, kTSYEntitlementTestability, kPlain),
+    row(32, TSYHandlePersonaList, kAllowed, kUnentitledLookup),
+}};
+
+}  // namespace
+
+const std::array<TSYCommandRow, kTSYCommandCount>& TSYCommandTable() {
+  return kTable;
+}

@@ -1,0 +1,349 @@
+#include "Daemon/TSYContainerCache.h"
+
+#include <set>
+
+#include "Daemon/TSYCodeSigningMapping.h"
+#include "Daemon/TSYException.h"
+#include "Daemon/TSYFileManager.h"
+#include "Daemon/TSYGlobalConfiguration.h"
+#include "Daemon/TSYLog.h"
+#include "Daemon/TSYWhitelist.h"
+#include "Platform/os/Platform.h"
+#include "Platform/os/Signpost.h"
+
+using platform::MutexLock;
+
+namespace {
+
+const char* mark(bool transient) {
+  return transient ? "(transient)" : "";
+}
+
+std::string identifierOf(const TSYUserIdentityRef& userIdentity) {
+  return userIdentity ? userIdentity->identifier() : std::string();
+}
+
+}  // namespace
+
+size_t TSYContainerCache::IdentifierHash::operator()(const std::string& identifier) const {
+  return std::hash<std::string>{}(identifier);
+}
+
+size_t TSYContainerCache::IdentifierHash::operator()(const TSYMetadataRef& metadata) const {
+  return std::hash<std::string>{}(metadata->identifier());
+}
+
+bool TSYContainerCache::IdentifierEqual::operator()(const TSYMetadataRef& left,
+                                                    const TSYMetadataRef& right) const {
+  return left->identifier() == right->identifier();
+}
+
+bool TSYContainerCache::IdentifierEqual::operator()(const std::string& left,
+                                                    const TSYMetadataRef& right) const {
+  return left == right->identifier();
+}
+
+TSYMetadataRef TSYContainerCache::ClassCache::find(const std::string& identifier) const {
+  const auto found = containers.find(identifier);
+  return found == containers.end() ? nullptr : *found;
+}
+
+void TSYContainerCache::ClassCache::store(TSYMetadataRef metadata) {
+  // The one that is there is equal by identifier: it has to go for the new one to come in.
+  containers.erase(metadata);
+  containers.insert(std::move(metadata));
+}
+
+TSYContainerCache& TSYContainerCache::sharedInstance() {
+  static TSYContainerCache& cache =
+      *new TSYContainerCache(TSYUserIdentitySharedCache::sharedInstance(),
+                             TSYCodeSigningMapping::sharedInstance());
+  return cache;
+}
+
+TSYContainerCache::TSYContainerCache(TSYUserIdentityCache& userIdentityCache,
+                                     TSYCodeSigningMapping& codeSigningMapping)
+    : userIdentityCache_(userIdentityCache), codeSigningMapping_(codeSigningMapping) {
+  userIdentityCache_.addObserver(*this);
+}
+
+TSYContainerCache::~TSYContainerCache() {
+  userIdentityCache_.removeObserver(*this);
+}
+
+std::string TSYContainerCache::cacheKey(const TSYUserIdentityRef& userIdentity,
+                                        TSYContainerClass containerClass) {
+  const std::string_view key = TSYContainerClassKey(containerClass);
+  if (!TSYUserIdentity::isUserIdentityRequiredForContainerClass(containerClass)) {
+    return std::string(key);
+  }
+  std::string text = "[";
+  text += identifierOf(userIdentity);
+  text += "]-";
+  text += key;
+  return text;
+}
+
+bool TSYContainerCache::containerURLIsValidForContainerClass(const TSYURL& url,
+                                                             TSYContainerClass containerClass) {
+  const std::string name(url.lastPathComponent());
+  return platform::UUID::parse(name).has_value() ||
+         TSYWhitelist::sharedWhitelist().containerIdIsWellknown(name, containerClass);
+}
+
+TSYResult<TSYContainerCache::ClassCache*> TSYContainerCache::_lock_getCache(
+    const TSYUserIdentityRef& userIdentity, TSYContainerClass contentClass, bool transient,
+    bool populateSandboxCache) {
+  const std::string key = cacheKey(userIdentity, contentClass);
+  Caches& caches = _lock_caches(transient);
+  if (const auto found = caches.find(key); found != caches.end()) return &found->second;
+  TSYLogWrite(TSYLogLevelDebug, "Rebuilding container class cache: {}{}", key, mark(transient));
+  TSY_SIGNPOST_BEGIN(RebuildingCache, this, contentClass);
+  auto scanned = _lock_scan(userIdentity, contentClass, transient, populateSandboxCache);
+  TSY_SIGNPOST_END(RebuildingCache, this, contentClass);
+  if (!scanned) {
+    return TSYFailure(TSYErrorCreate(TSYErrorCacheRebuildFailed, scanned.error(), TSYLogIt::yes,
+                                     "Cache: [{}]-{}{}: Failed to rebuild",
+                                     identifierOf(userIdentity), TSYContainerClassKey(contentClass),
+                                     mark(transient)));
+  }
+  return &caches.emplace(key, std::move(*scanned)).first->second;
+}
+
+TSYResult<TSYContainerCache::ClassCache> TSYContainerCache::_lock_scan(
+    const TSYUserIdentityRef& userIdentity, TSYContainerClass contentClass, bool transient,
+    bool populateSandboxCache) {
+  const auto directory =
+      TSYGlobalConfiguration::sharedInstance().containerDirectoryURLForUserIdentity(
+          userIdentity, contentClass, transient);
+  if (!directory) {
+    return TSYFailure(TSYPosixErrorCreate(platform::Errno{ENOENT}, "no class directory for {}",
+                                          cacheKey(userIdentity, contentClass)));
+  }
+  auto items = TSYFileManager::defaultManager().urlsForItemsInDirectoryAtURL(*directory);
+  if (!items) return TSYFailure(std::move(items.error()));
+
+  ClassCache cache{std::make_shared<const std::string>(directory->path()), {}};
+  const platform::Sandbox::Batch batch(platform::Platform::current().sandbox);
+  for (const TSYURL& item : *items) {
+    if (!containerURLIsValidForContainerClass(item, contentClass)) continue;
+    auto metadata =
+        TSYMetadata::readAndValidateMetadataAtUrl(item, userIdentity,
+                                                  /*checkClassPath=*/true, userIdentityCache_);
+    if (!metadata) continue;
+    metadata->setURL(cache.directory, std::string(item.lastPathComponent()));
+    metadata->setTransient(transient);
+    metadata->setExisted(true);
+    if (populateSandboxCache && !transient) _lock_pushMapping(*metadata);
+    cache.store(std::make_shared<const TSYMetadata>(std::move(*metadata)));
+  }
+  return cache;
+}
+
+TSYResult<TSYMetadataRef> TSYContainerCache::containerForContainerIdentity(
+    const TSYContainerIdentity& identity, bool transient, bool updateSandbox) {
+  return TSYCatchingExceptions([&] { return lookUp(identity, transient, updateSandbox); });
+}
+
+TSYResult<TSYMetadataRef> TSYContainerCache::lookUp(const TSYContainerIdentity& identity,
+                                                    bool transient, bool updateSandbox) {
+  TSYMetadataRef container;
+  {
+    const MutexLock lock(cacheLock_);
+    auto cache = _lock_getCache(identity.userIdentity(), identity.containerClass(), transient,
+                                updateSandbox);
+    if (!cache) return TSYFailure(std::move(cache.error()));
+    container = (*cache)->find(identity.identifier());
+  }
+  if (!container) {
+    // Lookups may miss: this is no line in the log.
+    return TSYFailure(TSYErrorCreate(TSYErrorNotFound, std::nullopt, TSYLogIt::no,
+                                     "Cache: {}{}: Container Not Found with ID: {}",
+                                     cacheKey(identity.userIdentity(), identity.containerClass()),
+                                     mark(transient), identity.identifier()));
+  }
+  auto onDisk = checkStillOnDisk({identity.userIdentity(), container}, transient);
+  if (!onDisk) return TSYFailure(std::move(onDisk.error()));
+  TSYLogWrite(TSYLogLevelDebug, "Cache: {}{}: Found Identifier: {}",
+              cacheKey(identity.userIdentity(), identity.containerClass()), mark(transient),
+              identity.identifier());
+  return container;
+}
+
+TSYMetadataRef TSYContainerCache::containerForContainerIdentity(
+    const TSYConcreteContainerIdentity& identity) {
+  const MutexLock lock(cacheLock_);
+  for (const bool transient : {false, true}) {
+    const auto cache = _lock_getCache(identity.userIdentity(), identity.containerClass(), transient,
+                                      /*populateSandboxCache=*/true);
+    if (!cache) continue;
+    TSYMetadataRef container = (*cache)->find(identity.identifier());
+    if (container && container->uuid() == identity.uuid()) return container;
+  }
+  return nullptr;
+}
+
+TSYResult<void> TSYContainerCache::checkStillOnDisk(const Found& found, bool transient) {
+  const TSYMetadata& container = *found.container;
+  const TSYURL file = container.metadataFileURL();
+  if (TSYFileManager::defaultManager().itemExistsAtURL(file)) return {};
+  TSYError inconsistent =
+      TSYErrorCreate(TSYErrorCacheInconsistent, std::nullopt, TSYLogIt::yes,
+                     "Cache: {}{}: INCONSISTENT-No Metadata at: {} for id: {}, class: {}",
+                     cacheKey(found.keyedUnder, container.containerClass()), mark(transient),
+                     file.path(), container.identifier(), container.containerClass());
+  const auto removed =
+      remove(found.keyedUnder, container.containerClass(), container.identifier(), transient);
+  if (!removed) {
+    TSYLogWrite(TSYLogLevelError,
+                "Failed to remove from cache user: {}, id: {}, class: {}, transient: {:d} : {}",
+                identifierOf(found.keyedUnder), container.identifier(), container.containerClass(),
+                transient, removed.error());
+  }
+  return TSYFailure(std::move(inconsistent));
+}
+
+TSYResult<std::vector<TSYMetadataRef>> TSYContainerCache::allContainersForUserIdentity(
+    const TSYUserIdentityRef& userIdentity, TSYContainerClass contentClass, bool transient,
+    bool populateSandboxCache) {
+  return TSYCatchingExceptions(
+      [&] { return list(userIdentity, contentClass, transient, populateSandboxCache); });
+}
+
+TSYResult<std::vector<TSYMetadataRef>> TSYContainerCache::list(
+    const TSYUserIdentityRef& userIdentity, TSYContainerClass contentClass, bool transient,
+    bool populateSandboxCache) {
+  if (!TSYIsContainerClass(contentClass)) {
+    return TSYFailure(TSYErrorCreate(TSYErrorCacheInvalidInput, std::nullopt, TSYLogIt::yes,
+                                     "Invalid Content Class: {}",
+                                     static_cast<int64_t>(contentClass)));
+  }
+  auto collected = collect(userIdentity, contentClass, transient, populateSandboxCache);
+  if (!collected) return TSYFailure(std::move(collected.error()));
+  std::vector<TSYMetadataRef> containers;
+  containers.reserve(collected->size());
+  for (Found& found : *collected) {
+    if (!checkStillOnDisk(found, transient)) continue;
+    TSYLogWrite(TSYLogLevelDebug, "Cache: {}{}: ALL Found Identifier: {}",
+                cacheKey(found.keyedUnder, contentClass), mark(transient),
+                found.container->identifier());
+    containers.push_back(std::move(found.container));
+  }
+  return containers;
+}
+
+std::vector<TSYUserIdentityRef> TSYContainerCache::identitiesToList(
+    const TSYUserIdentityRef& userIdentity, TSYContainerClass contentClass) {
+  if (!userIdentity || !userIdentity->isNoSpecificPersona()) return {userIdentity};
+  // Identities that share a key would list the same containers twice.
+  std::vector<TSYUserIdentityRef> identities;
+  std::set<std::string> keys;
+  userIdentityCache_.forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
+      [&](const TSYUserIdentityRef& accessible) {
+        if (keys.insert(cacheKey(accessible, contentClass)).second)
+          identities.push_back(accessible);
+      });
+  return identities;
+}
+
+TSYResult<std::vector<TSYContainerCache::Found>> TSYContainerCache::collect(
+    const TSYUserIdentityRef& userIdentity, TSYContainerClass contentClass, bool transient,
+    bool populateSandboxCache) {
+  const std::vector<TSYUserIdentityRef> identities = identitiesToList(userIdentity, contentClass);
+  std::vector<Found> collected;
+  std::optional<TSYError> failure;
+  const MutexLock lock(cacheLock_);
+  for (const TSYUserIdentityRef& identity : identities) {
+    auto cache = _lock_getCache(identity, contentClass, transient, populateSandboxCache);
+    if (!cache) {
+      failure = std::move(cache.error());
+      continue;
+    }
+    for (const TSYMetadataRef& container : (*cache)->containers) {
+      collected.push_back({identity, container});
+    }
+  }
+  if (failure) return TSYFailure(std::move(*failure));
+  return collected;
+}
+
+TSYResult<void> TSYContainerCache::addContainerMetadata(const TSYMetadata& metadata,
+                                                        const TSYURL& url, bool transient,
+                                                        bool updateSandbox) {
+  return TSYCatchingExceptions([&] { return add(metadata, url, transient, updateSandbox); });
+}
+
+TSYResult<void> TSYContainerCache::add(const TSYMetadata& metadata, const TSYURL& url,
+                                       bool transient, bool updateSandbox) {
+  if (url.path().empty()) {
+    return TSYFailure(TSYErrorCreate(TSYErrorCacheInvalidInput, std::nullopt, TSYLogIt::yes,
+                                     "Invalid input: URL: {}", "(null)"));
+  }
+  bool shouldRegister = false;
+  {
+    const MutexLock lock(cacheLock_);
+    auto cache = _lock_getCache(metadata.userIdentity(), metadata.containerClass(), transient,
+                                /*populateSandboxCache=*/true);
+    if (!cache) return TSYFailure(std::move(cache.error()));
+    TSYMetadata entry = metadata;
+    if (url.deletingLastPathComponent().path() == *(*cache)->directory) {
+      entry.setURL((*cache)->directory, std::string(url.lastPathComponent()));
+    } else {
+      entry.setURL(url);
+    }
+    entry.setTransient(transient);
+    entry.setExisted(true);
+    (*cache)->store(std::make_shared<const TSYMetadata>(std::move(entry)));
+    shouldRegister = updateSandbox &&
+                     shouldRegisterSandboxMappingWithUserIdentity(
+                         metadata.userIdentity(), metadata.identifier(), metadata.containerClass());
+  }
+  if (shouldRegister && !transient &&
+      !setSandboxContainerMappingForUserIdentity(metadata.userIdentity(), metadata.identifier(),
+                                                 metadata.containerClass(), url)) {
+    TSYLogWrite(TSYLogLevelError, "Failed to set container mapping of {}, {}",
+                metadata.identifier(), metadata.containerClass());
+  }
+  TSYLogWrite(TSYLogLevelDebug, "Cache: {}{}: Added Identifier: {}",
+              cacheKey(metadata.userIdentity(), metadata.containerClass()), mark(transient),
+              metadata.identifier());
+  return {};
+}
+
+TSYResult<void> TSYContainerCache::removeContainerForUserIdentity(
+    const TSYUserIdentityRef& userIdentity, TSYContainerClass contentClass,
+    const std::string& identifier, bool transient) {
+  return TSYCatchingExceptions(
+      [&] { return remove(userIdentity, contentClass, identifier, transient); });
+}
+
+TSYResult<void> TSYContainerCache::remove(const TSYUserIdentityRef& userIdentity,
+                                          TSYContainerClass contentClass,
+                                          const std::string& identifier, bool transient) {
+  if (!TSYIsContainerClass(contentClass)) {
+    return TSYFailure(TSYErrorCreate(TSYErrorCacheInvalidInput, std::nullopt, TSYLogIt::yes,
+                                     "Invalid Content Class: {}",
+                                     static_cast<int64_t>(contentClass)));
+  }
+  bool shouldRegister = false;
+  {
+    const MutexLock lock(cacheLock_);
+    auto cache = _lock_getCache(userIdentity, contentClass, transient,
+                                /*populateSandboxCache=*/true);
+    if (!cache) return TSYFailure(std::move(cache.error()));
+    if (const TSYMetadataRef container = (*cache)->find(identifier)) {
+      (*cache)->containers.erase(container);
+    }
+    shouldRegister =
+        shouldRegisterSandboxMappingWithUserIdentity(userIdentity, identifier, contentClass);
+  }
+  if (shouldRegister && !transient &&
+      !setSandboxContainerMappingForUserIdentity(userIdentity, identifier, contentClass,
+                                                 std::nullopt)) {
+    TSYLogWrite(TSYLogLevelError, "Failed to remove container mapping of {}, {}", identifier,
+                contentClass);
+  }
+  TSYLogWrite(TSYLogLevelDebug, "Cache: {}{}: Removed Identifier: {}",
+              cacheKey(userIdentity, contentClass), mark(transient), identifier);
+  return {};
+}

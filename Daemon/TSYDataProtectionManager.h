@@ -1,0 +1,17 @@
+// The protection classes of data containers.
+//
+// Changing a class is not built yet, and the class that an application's entitlements ask for needs
+// the code-signing database: until it is there nobody asks for any, and the answer is 0.
+//
+// All operations may be called from any thread.
+#pragma once
+
+#include <string>
+
+class TSYDataProtectionManager {
+ public:
+  static TSYDataProtectionManager& defaultManager();
+
+  // The protection class that the entitlements of an application ask for; 0 for none.
+  int intendedDataProtectionClassBasedOnEntitlementsForIdentifier(const std::string& identifier);
+};

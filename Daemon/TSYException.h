@@ -1,0 +1,23 @@
+// The boundary of an operation that is said to survive exceptions.
+#pragma once
+
+#include <exception>
+#include <typeinfo>
+#include <utility>
+
+#include "Daemon/TSYError.h"
+
+// "name : reason" of the exception becomes a failure of code 40, logged.
+TSYError TSYErrorFromException(const std::exception& exception, std::source_location where);
+
+// Runs `operation`, which returns a TSYResult; an exception that escapes it becomes code 40.
+template <typename Operation>
+auto TSYCatchingExceptions(Operation&& operation,
+                           std::source_location where = std::source_location::current())
+    -> decltype(operation()) {
+  try {
+    return std::forward<Operation>(operation)();
+  } catch (const std::exception& exception) {
+    return TSYFailure(TSYErrorFromException(exception, where));
+  }
+}

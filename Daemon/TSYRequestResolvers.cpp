@@ -1,0 +1,191 @@
+#include "Daemon/TSYRequestResolvers.h"
+
+#include "Daemon/TSYCodeSigningMapping.h"
+#include "Daemon/TSYContainerCache.h"
+#include "Daemon/TSYLog.h"
+#include "Platform/os/Platform.h"
+
+using platform::LogLevel;
+using platform::Platform;
+using platform::ipc::Message;
+
+namespace {
+
+std::optional<std::string> stringUnder(const Message& request, std::string_view key) {
+  const std::string* value = request.string(key);
+  return value == nullptr ? std::nullopt : std::optional(*value);
+}
+
+std::string descriptionOf(const TSYUserIdentityCache::IdentitySet& identities) {
+  std::string text = "{(";
+  for (const TSYUserIdentityRef& identity : identities) {
+    if (text.size() > 2) text += ", ";
+    text += identity->shortDescription();
+  }
+  return text + ")}";
+}
+
+TSYUserIdentityRef clientsUser(const TSYClientConnection& connection) {
+  return connection.clientIdentity() ? connection.clientIdentity()->userIdentity() : nullptr;
+}
+
+// The bundle whose personas decide: plug-ins follow the application that they belong to.
+std::string bundleIdentifierFor(const std::string& identifier, TSYContainerClass containerClass) {
+  if (containerClass != kTSYContainerClassPluginData &&
+      containerClass != kTSYContainerClassVPNPluginData) {
+    return identifier;
+  }
+  return TSYCodeSigningMapping::sharedInstance()
+      .parentIdentifierForChildIdentifier(identifier)
+      .value_or(identifier);
+}
+
+// The sandbox extension class of a container class; null when there is none.
+const char* extensionClassFor(TSYContainerClass containerClass) {
+  switch (containerClass) {
+    case kTSYContainerClassAppData:
+    case kTSYContainerClassPluginData:
+    case kTSYContainerClassVPNPluginData:
+    case kTSYContainerClassInternalDaemon:
+      return "com.veltra.sandbox.container";
+    case kTSYContainerClassAppGroup:
+      return "com.veltra.sandbox.application-group";
+    default:
+      return nullptr;
+  }
+}
+
+}  // namespace
+
+std::optional<std::string> TSYResolveIdentifier(const Message& request,
+                                                const TSYClientConnection& connection,
+                                                TSYIdentifierFallback fallback) {
+  if (auto identifier = stringUnder(request, kTSYRequestIdentifier)) return identifier;
+  if (fallback == TSYIdentifierFallback::none || !connection.clientIdentity()) return std::nullopt;
+  return connection.clientBundleIdentifier();
+}
+
+TSYResolved<TSYUserIdentityRef> TSYResolveUserIdentityForIdentifier(
+    const TSYClientConnection& connection, const std::string& identifier,
+    TSYContainerClass containerClass) {
+  const TSYUserIdentityRef own = clientsUser(connection);
+  if (!own) return std::unexpected(uint64_t{TSYErrorPersonaMismatch});
+  if (!TSYIsPerUserClass(containerClass) || !own->isNoSpecificPersona()) return own;
+
+  const std::string bundleIdentifier = bundleIdentifierFor(identifier, containerClass);
+  const auto identities =
+      TSYContainerCache::sharedInstance().userIdentityCache().userIdentitiesForBundleIdentifier(
+          bundleIdentifier);
+  if (TSYLogIsEnabled(TSYLogLevelDebug)) {
+    TSYLogWrite(TSYLogLevelDebug,
+                "Chose bundleIdentifier: {}, userIdentities: {} for identifier: {}, class: {}",
+                bundleIdentifier, descriptionOf(identities), identifier, containerClass);
+  }
+  if (identities.size() == 1) return *identities.begin();
+  if (identities.empty()) {
+    TSYLogWrite(TSYLogLevelError, "{} trying to look up persona for {}:{}",
+                connection.clientBundleIdentifier(), containerClass, identifier);
+  } else if (!identities.contains(own)) {
+    TSYSystemLogWrite(TSYChannel::unspecified, LogLevel::fault,
+                      "Ambiguous user identity from [{}]. Expected one of [{}], got {}",
+                      bundleIdentifier, descriptionOf(identities), own->shortDescription());
+  }
+  return own;
+}
+
+TSYResolved<TSYContainerIdentity> TSYResolveContainerIdentity(const Message& request,
+                                                              const TSYClientConnection& connection,
+                                                              TSYIdentifierFallback fallback,
+                                                              std::string_view classKey) {
+  const auto identifier = TSYResolveIdentifier(request, connection, fallback);
+  if (!identifier) return std::unexpected(uint64_t{TSYErrorMissingIdentifier});
+  const TSYContainerClass containerClass = request.uint64(classKey).value_or(0);
+  if (!TSYIsContainerClass(containerClass)) {
+    return std::unexpected(TSYErrorCreate(TSYErrorUnexpectedContainerType, std::nullopt,
+                                          TSYLogIt::yes, "Passed an unexpected container type: {}",
+                                          containerClass)
+                               .code());
+  }
+  auto userIdentity = TSYResolveUserIdentityForIdentifier(connection, *identifier, containerClass);
+  if (!userIdentity) return std::unexpected(userIdentity.error());
+  auto identity = TSYContainerIdentity::containerIdentityWithUserIdentity(
+      std::move(*userIdentity), *identifier, containerClass);
+  if (!identity) return std::unexpected(identity.error().code());
+  return std::move(*identity);
+}
+
+TSYResolved<TSYUserIdentityRef> TSYResolvePersona(const TSYClientConnection& connection,
+                                                  const std::optional<std::string>& uniqueString) {
+  const TSYUserIdentityRef own = clientsUser(connection);
+  if (!own) return std::unexpected(uint64_t{TSYErrorPersonaMismatch});
+  if (Platform::current().device.isMultiUser()) return own;
+  auto identity = TSYUserIdentitySharedCache::sharedInstance()
+                      .userIdentityForCurrentUserWithPersonaUniqueString(uniqueString);
+  if (!identity) {
+    TSYLogWrite(TSYLogLevelError,
+                "Cannot reconstitute a user identity from provided persona unique string; client = "
+                "[{}], personaUniqueString = [{}]",
+                connection.clientIdentity()->description(), uniqueString.value_or("(null)"));
+    return std::unexpected(uint64_t{TSYErrorPersonaMismatch});
+  }
+  if (!own->isNoSpecificPersona() && !identity->isEqualToUserIdentity(*own)) {
+    TSYLogWrite(TSYLogLevelError,
+                "Persona unique string is not valid for this client; client = [{}], "
+                "personaUniqueString = [{}]",
+                connection.clientIdentity()->description(), uniqueString.value_or("(null)"));
+    return std::unexpected(uint64_t{TSYErrorPersonaMismatch});
+  }
+  return identity;
+}
+
+TSYResolved<TSYConcreteContainerIdentity> TSYResolveConcreteContainerIdentity(
+    const Message& request, const TSYClientConnection& connection, const TSYConcreteKeys& keys) {
+  const auto identifier = stringUnder(request, keys.identifier);
+  if (!identifier) return std::unexpected(uint64_t{TSYErrorMissingIdentifier});
+  const TSYContainerClass containerClass = request.uint64(keys.containerClass).value_or(0);
+  if (!TSYIsContainerClass(containerClass)) {
+    return std::unexpected(TSYErrorCreate(TSYErrorUnexpectedContainerType, std::nullopt,
+                                          TSYLogIt::yes, "Passed an unexpected container type: {}",
+                                          containerClass)
+                               .code());
+  }
+  TSYUserIdentityRef userIdentity = clientsUser(connection);
+  if (TSYUserIdentity::isUserIdentityRequiredForContainerClass(containerClass)) {
+    auto persona = TSYResolvePersona(connection, stringUnder(request, keys.persona));
+    if (!persona) return std::unexpected(persona.error());
+    userIdentity = std::move(*persona);
+  }
+  const platform::UUID* uuid = request.uuid(keys.uuid);
+  auto identity = TSYConcreteContainerIdentity::containerIdentityWithUUID(
+      uuid == nullptr ? std::nullopt : std::optional(*uuid), std::move(userIdentity), *identifier,
+      containerClass);
+  if (!identity) return std::unexpected(identity.error().code());
+  return std::move(*identity);
+}
+
+std::optional<std::string> TSYIssueSandboxExtension(const TSYMetadata& container,
+                                                    const TSYClientIdentity& client) {
+  if (!client.sandboxed()) return std::nullopt;
+  const std::string path = container.url().path();
+  const bool isEnterprise = container.userIdentity() && container.userIdentity()->isEnterprise();
+  const char* extensionClass = extensionClassFor(container.containerClass());
+  if (!isEnterprise || extensionClass == nullptr) {
+    TSYSystemLogWrite(TSYChannel::sandbox, LogLevel::info,
+                      "{} is sandboxed and container (type: {}) is enterprise: {:d}. NOT issuing "
+                      "token for path: {}",
+                      client.bundleIdentifier(), container.containerClass(), isEnterprise, path);
+    return std::nullopt;
+  }
+  TSYSystemLogWrite(TSYChannel::sandbox, LogLevel::standard,
+                    "{} is sandboxed and container (type: {}) is enterprise: {:d}. Issuing token "
+                    "for path: {}",
+                    client.bundleIdentifier(), container.containerClass(), isEnterprise, path);
+  auto token =
+      Platform::current().sandbox.issueFileExtension(extensionClass, path, client.auditToken());
+  if (!token) {
+    TSYLogWrite(TSYLogLevelError, "sandbox_extension_issue_file failed for {} at path {}: {}",
+                client.bundleIdentifier(), path, token.error().value);
+    return std::nullopt;
+  }
+  return std::move(*token);
+}

@@ -1,0 +1,122 @@
+#include "Platform/os/SandboxLog.h"
+
+#include <fmt/format.h>
+#include <unistd.h>
+
+#include <array>
+#include <charconv>
+#include <vector>
+
+#include "Platform/os/RuntimeDirectory.h"
+#include "Platform/os/Sandbox.h"
+
+namespace platform {
+namespace {
+
+void appendEncoded(std::string& line, std::string_view text) {
+  for (const char c : text) {
+    const auto byte = static_cast<unsigned char>(c);
+    if (byte > 0x20 && byte != 0x7F && c != '%') {
+      line += c;
+    } else {
+      fmt::format_to(std::back_inserter(line), "%{:02X}", byte);
+    }
+  }
+}
+
+template <typename Number>
+bool parseNumber(std::string_view text, Number& number, int base = 10) {
+  const auto parsed = std::from_chars(text.data(), text.data() + text.size(), number, base);
+  return parsed.ec == std::errc() && parsed.ptr == text.data() + text.size();
+}
+
+std::optional<std::string> decoded(std::string_view text) {
+  std::string result;
+  for (size_t i = 0; i < text.size(); ++i) {
+    if (text[i] != '%') {
+      result += text[i];
+      continue;
+    }
+    uint8_t byte = 0;
+    if (text.size() - i < 3 || !parseNumber(text.substr(i + 1, 2), byte, 16)) return std::nullopt;
+    result += static_cast<char>(byte);
+    i += 2;
+  }
+  return result;
+}
+
+// Takes the text up to the next tab, or all of it, out of `line`.
+std::optional<std::string_view> takeField(std::optional<std::string_view>& line) {
+  if (!line) return std::nullopt;
+  const size_t tab = line->find('\t');
+  const std::string_view field = line->substr(0, tab);
+  line = tab == std::string_view::npos ? std::nullopt : std::optional(line->substr(tab + 1));
+  return field;
+}
+
+}  // namespace
+
+std::string sandboxLogPath(const FileSystem& files) {
+  return runtimeDirectory(files) + "/sandbox/mappings";
+}
+
+std::string formatMappingLine(const SandboxMappingKey& key,
+                              const std::optional<std::string>& path) {
+  std::string line =
+      fmt::format("{}\t{}\t{}\t{}\t", path ? "set" : "clear", key.uid, key.personaID, key.itemType);
+  appendEncoded(line, key.identifier);
+  if (path) {
+    line += '\t';
+    appendEncoded(line, *path);
+  }
+  line += '\n';
+  return line;
+}
+
+std::optional<SandboxMapping> parseMappingLine(std::string_view line) {
+  std::optional<std::string_view> rest = line;
+  const auto verb = takeField(rest);
+  const bool isSet = verb == "set";
+  if (!isSet && verb != "clear") return std::nullopt;
+  SandboxMapping mapping;
+  if (!parseNumber(takeField(rest).value_or(""), mapping.uid) ||
+      !parseNumber(takeField(rest).value_or(""), mapping.personaID) ||
+      !parseNumber(takeField(rest).value_or(""), mapping.itemType) || !rest) {
+    return std::nullopt;
+  }
+  auto identifier = decoded(*takeField(rest));
+  if (!identifier || rest.has_value() != isSet) return std::nullopt;
+  mapping.identifier = *std::move(identifier);
+  if (!isSet) return mapping;
+  mapping.path = decoded(*takeField(rest));
+  if (!mapping.path || rest) return std::nullopt;
+  return mapping;
+}
+
+Result<void> forEachLine(int descriptor, const std::function<void(std::string_view)>& visit) {
+  std::vector<char> block(64 * 1024);
+  std::string line;  // what of the current line has been read, while it is not too long
+  bool tooLong = false;
+  for (;;) {
+    const ssize_t count = ::read(descriptor, block.data(), block.size());
+    if (count < 0 && errno == EINTR) continue;
+    if (count < 0) return lastErrno();
+    if (count == 0) break;
+    std::string_view text(block.data(), static_cast<size_t>(count));
+    while (!text.empty()) {
+      const size_t end = text.find('\n');
+      const std::string_view piece = text.substr(0, end);
+      tooLong = tooLong || line.size() + piece.size() > kLongestMappingLine;
+      if (!tooLong) line += piece;
+      if (end == std::string_view::npos) break;
+      visit(tooLong ? std::string_view() : line);
+      line.clear();
+      tooLong = false;
+      text.remove_prefix(end + 1);
+    }
+  }
+  if (!line.empty() || tooLong) visit({});
+  return {};
+}
+
+}  // namespace platform

@@ -1,0 +1,77 @@
+#include "Tools/tessaryctl/OwnRecord.h"
+
+#include <fcntl.h>
+#include <fmt/format.h>
+#include <unistd.h>
+
+#include "Platform/base/FileDescriptor.h"
+#include "Platform/os/OpenFile.h"
+#include "Platform/os/RuntimeDirectory.h"
+#include "Platform/os/Tasks.h"
+#include "Platform/values/PropertyList.h"
+
+using platform::FileSystem;
+using platform::TaskRecord;
+using platform::Value;
+
+namespace {
+
+constexpr char kIdentifier[] = "com.veltra.tessaryctl";
+constexpr char kPrefix[] = "com.veltra.private.Tessary.";
+
+std::shared_ptr<const Value::Dictionary> everyEntitlement() {
+  Value::Dictionary entitlements;
+  for (const char* name : {"allowed", "userManagedAssets", "deleteContainerContent",
+                           "dataMigration", "testability", "stageSharedContent"}) {
+    entitlements.emplace(std::string(kPrefix) + name, true);
+  }
+  return std::make_shared<const Value::Dictionary>(std::move(entitlements));
+}
+
+std::expected<std::shared_ptr<const Value::Dictionary>, std::string> entitlementsIn(
+    const std::string& path) {
+  const platform::FileDescriptor file(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
+  if (!file.valid()) return std::unexpected(platform::Errno{errno}.message());
+  const auto bytes = platform::readToEnd(file.get(), platform::PropertyListLimits::kBytes);
+  if (!bytes) return std::unexpected(bytes.error().message());
+  auto value = platform::readPropertyList(*bytes);
+  if (!value) return std::unexpected(value.error().reason);
+  if (value->asDictionary() == nullptr) return std::unexpected("it holds no dictionary");
+  return std::make_shared<const Value::Dictionary>(std::move(*value->asDictionary()));
+}
+
+bool choosesAnother(const OwnRecordOptions& options) {
+  return options.identifier || options.entitlementsFile || options.sandboxed || options.persona;
+}
+
+}  // namespace
+
+std::optional<std::string> writeOwnRecord(const OwnRecordOptions& options) {
+  const auto files = FileSystem::open(
+      options.root, ::geteuid() == 0 ? platform::Privilege::root : platform::Privilege::none);
+  if (!files) return fmt::format("cannot use {}: {}", options.root, files.error().message());
+  const auto startTime = platform::processStartTime(::getpid());
+  if (!startTime) return startTime.error().message();
+  const platform::Tasks tasks(**files);
+  if (tasks.record(::getpid(), *startTime)) {
+    if (choosesAnother(options)) return "this process has a record already; it cannot be changed";
+    return std::nullopt;
+  }
+  TaskRecord record{.signingIdentifier = options.identifier.value_or(kIdentifier),
+                    .entitlements = everyEntitlement(),
+                    .sandboxed = options.sandboxed,
+                    .personaUniqueString = options.persona};
+  if (options.entitlementsFile) {
+    auto entitlements = entitlementsIn(*options.entitlementsFile);
+    if (!entitlements) {
+      return fmt::format("--entitlements {}: {}", *options.entitlementsFile, entitlements.error());
+    }
+    record.entitlements = std::move(*entitlements);
+  }
+  const auto written = tasks.write(::getpid(), *startTime, record);
+  // Without the rights to write one, the daemon will say what it thinks of a process without.
+  if (!written && choosesAnother(options)) {
+    return fmt::format("cannot write a record: {}", written.error().message());
+  }
+  return std::nullopt;
+}
