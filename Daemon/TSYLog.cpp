@@ -8,9 +8,11 @@
 #include <pthread.h>
 #include <spdlog/logger.h>
 #include <spdlog/sinks/rotating_file_sink.h>
+#include <sys/stat.h>
 
 #include <array>
 #include <atomic>
+#include <cstdio>
 #include <cstdlib>
 #include <exception>
 #include <memory>
@@ -19,6 +21,8 @@
 #include "Platform/base/Mutex.h"
 
 namespace {
+
+constexpr mode_t kLogFileMode = 0644;
 
 struct DaemonLog {
   int32_t threshold;
@@ -126,8 +130,13 @@ const std::string* crashReportMessage GUARDED_BY(crashReportMutex) = nullptr;
 
 bool TSYLogOpen(const std::string& path, int32_t threshold, TSYLogRotation rotation) {
   try {
-    auto sink = std::make_shared<spdlog::sinks::rotating_file_sink_mt>(path, rotation.bytesPerFile,
-                                                                       rotation.files - 1);
+    // The daemon's umask is 0: each file is given its mode when it is opened.
+    spdlog::file_event_handlers handlers;
+    handlers.after_open = [](const spdlog::filename_t&, std::FILE* file) {
+      (void)::fchmod(::fileno(file), kLogFileMode);
+    };
+    auto sink = std::make_shared<spdlog::sinks::rotating_file_sink_mt>(
+        path, rotation.bytesPerFile, rotation.files - 1, /*rotate_on_open=*/false, handlers);
     sink->set_pattern("%Y-%m-%d %H:%M:%S.%e %P %t %L %v");
     auto log = std::make_unique<DaemonLog>(threshold, spdlog::logger("com.veltra.tessaryd", sink));
     log->logger.set_level(spdlog::level::trace);

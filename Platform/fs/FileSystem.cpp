@@ -113,8 +113,9 @@ Result<const char*> FileSystem::relativeWithDots(const std::string& path) const 
 
 Result<const char*> FileSystem::relative(const std::string& path) const {
   const auto whole = relativeWithDots(path);
-  const bool isRoot = whole && *whole == std::string_view(".");
-  if (whole && !isRoot && hasDotComponent(*whole)) return failWith(EINVAL);
+  if (whole && hasDotComponent(std::string_view(path).substr(root_.size()))) {
+    return failWith(EINVAL);
+  }
   return whole;
 }
 

@@ -53,7 +53,7 @@ struct Place {
 // How a file is written. `mode` is applied exactly, whatever the umask.
 struct WriteOptions {
   mode_t mode = 0644;
-  std::optional<int> protectionClass;
+  std::optional<int> protectionClass = std::nullopt;
   bool atomic = false;  // write a temporary sibling, then rename it over the target
 };
 

@@ -132,15 +132,14 @@ const std::vector<Entry>* Accounts::refresh(Database<Entry>& database, const cha
   if (status && database.stamp == Stamp(*status)) return &database.entries;
   const auto file = files_.openItem(path);
   struct stat opened{};
-  if (!file || ::fstat(file->get(), &opened) != 0 || !S_ISREG(opened.st_mode)) {
-    platformLog(LogLevel::error, "Accounts::refresh", "{} is no file that can be opened", path);
-    return &database.entries;  // what was good last
-  }
-  if (database.stamp == Stamp(opened)) return &database.entries;
-  const auto bytes = readToEnd(file->get(), kLongestFile);
+  const bool isRegular = file && ::fstat(file->get(), &opened) == 0 && S_ISREG(opened.st_mode);
+  const auto bytes = isRegular ? readToEnd(file->get(), kLongestFile)
+                               : Result<std::vector<uint8_t>>(failWith(EINVAL));
   if (!bytes) {
+    // What was good last stays. The state is remembered: one line in the log for each.
     platformLog(LogLevel::error, "Accounts::refresh", "{} cannot be read: {}", path,
-                bytes.error().message());
+                file ? bytes.error().message() : file.error().message());
+    if (status) database.stamp = Stamp(*status);
     return &database.entries;
   }
   database.entries = parse<Entry>(asText(*bytes), path, fromLine);

@@ -43,7 +43,7 @@ Value::Dictionary readConfigurationDictionary(const FileSystem& files, const std
   auto value = readConfigurationFile(files, path);
   if (!value) return {};
   if (value->asDictionary() != nullptr) return std::move(*value->asDictionary());
-  static_cast<void>(malformed(path, fmt::format("a {} is no dictionary", value->typeName())));
+  static_cast<void>(malformed(path, fmt::format("no dictionary: {}", value->typeName())));
   return {};
 }
 

@@ -28,8 +28,10 @@ void expectMade(const TestPlatform& platform, const ExpectedDirectory& expected)
   struct stat status{};
   ASSERT_EQ(::stat(expected.url->path().c_str(), &status), 0) << expected.path;
   EXPECT_EQ(status.st_mode & 07777U, 0755U) << expected.path;
-  if (::geteuid() == 0) EXPECT_EQ(status.st_uid, expected.owner) << expected.path;
-  if (::geteuid() == 0) EXPECT_EQ(status.st_gid, expected.owner) << expected.path;
+  if (::geteuid() == 0) {
+    EXPECT_EQ(status.st_uid, expected.owner) << expected.path;
+    EXPECT_EQ(status.st_gid, expected.owner) << expected.path;
+  }
   const auto class_ =
       TSYFileManager::defaultManager().dataProtectionClassOfItemAtURL(*expected.url);
   EXPECT_EQ(class_.value_or(-1), expected.protectionClass) << expected.path;

@@ -116,8 +116,13 @@ TEST(TSYUserIdentityCache, aRequestMeansThePersonaOfItsCaller) {
     EXPECT_EQ(identity->personaType(), test.type) << name;
     EXPECT_EQ(identity->homeDirectoryURL()->path(), test.home) << name;
   }
-  // The context ended with its scope, and is the thread's own.
+  // A context ends with its scope, the outer one comes back, and both are the thread's own.
+  EXPECT_TRUE(cache.userIdentityForCurrentContext()->isNoSpecificPersona());
   const TSYUserIdentityCache::CallerContext context("E1");
+  {
+    const TSYUserIdentityCache::CallerContext inner("Z");
+  }
+  EXPECT_TRUE(cache.userIdentityForCurrentContext()->isEnterprise());
   TSYPersonaType elsewhere = TSYPersonaType::personal;
   std::thread([&] { elsewhere = cache.userIdentityForCurrentContext()->personaType(); }).join();
   EXPECT_EQ(elsewhere, TSYPersonaType::unspecific);

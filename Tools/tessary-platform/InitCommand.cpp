@@ -145,6 +145,9 @@ int complainOf(const std::string& what, platform::Errno error) {
 }
 
 int prepareDevice(const FileSystem& files, const std::vector<User>& users) {
+  // Two at once would lose the accounts of one.
+  const auto lock = platform::lockRuntimeDirectory(files);
+  if (!lock) return complainOf("the lock of run/tessary", lock.error());
   const std::string configuration = platform::configurationDirectory(files);
   if (const auto made = files.makePath(configuration, 0755); !made) {
     return complainOf(configuration, made.error());

@@ -43,7 +43,7 @@ std::shared_ptr<const platform::Value::Dictionary> readEntitlements(const std::s
   auto value = platform::readPropertyList(*bytes);
   if (!value) return reject(value.error().reason);
   if (value->asDictionary() == nullptr) {
-    return reject(fmt::format("a {} is no dictionary", value->typeName()));
+    return reject(fmt::format("no dictionary: {}", value->typeName()));
   }
   return std::make_shared<const platform::Value::Dictionary>(std::move(*value->asDictionary()));
 }

@@ -5,6 +5,7 @@
 #include "Platform/os/ConfigurationFile.h"
 #include "Platform/os/ContainerLayout.h"
 #include "Platform/os/KeyBag.h"
+#include "Platform/os/OpenFile.h"
 #include "Platform/os/PersonaList.h"
 #include "Platform/os/RuntimeDirectory.h"
 #include "Platform/os/SandboxLog.h"
@@ -19,6 +20,15 @@ using platform::Value;
 
 void heading(const char* text) {
   fmt::print("\n{}\n", text);
+}
+
+// What run/tessary holds is of no meaning once the device has been started anew.
+void showBoot(const FileSystem& files) {
+  constexpr size_t kLongestBootID = 4096;
+  const auto stored =
+      files.readFile(platform::runtimeDirectory(files) + "/boot-id", kLongestBootID);
+  const auto bootID = stored ? platform::asText(*stored) : "not yet known\n";
+  fmt::print("run/tessary is of boot: {}", bootID);
 }
 
 void showVersion(const FileSystem& files) {
@@ -129,6 +139,7 @@ int show(const Application& application) {
   const bool hasKey =
       files->status(platform::runtimeDirectory(*files) + "/extension.key").has_value();
   fmt::print("root: {}\n", files->root().empty() ? "/" : files->root());
+  showBoot(*files);
   fmt::print("lock state: {}\n", platform::KeyBag(*files).lockState());
   fmt::print("extension key: {}\n", hasKey ? "made" : "not yet made");
   showVersion(*files);

@@ -40,6 +40,12 @@ std::expected<std::shared_ptr<const Value::Dictionary>, std::string> entitlement
   return std::make_shared<const Value::Dictionary>(std::move(*value->asDictionary()));
 }
 
+// Records are read and written by the user whom the daemon runs as.
+bool mayKeepRecords(const FileSystem& files) {
+  const auto directory = files.status(platform::runtimeDirectory(files));
+  return directory && directory->st_uid == ::geteuid();
+}
+
 bool choosesAnother(const OwnRecordOptions& options) {
   return options.identifier || options.entitlementsFile || options.sandboxed || options.persona;
 }
@@ -50,6 +56,11 @@ std::optional<std::string> writeOwnRecord(const OwnRecordOptions& options) {
   const auto files = FileSystem::open(
       options.root, ::geteuid() == 0 ? platform::Privilege::root : platform::Privilege::none);
   if (!files) return fmt::format("cannot use {}: {}", options.root, files.error().message());
+  if (!mayKeepRecords(**files)) {
+    // The daemon will say what it thinks of this process as it is.
+    if (choosesAnother(options)) return "only the daemon's own user may choose who asks";
+    return std::nullopt;
+  }
   const auto startTime = platform::processStartTime(::getpid());
   if (!startTime) return startTime.error().message();
   const platform::Tasks tasks(**files);
@@ -69,9 +80,6 @@ std::optional<std::string> writeOwnRecord(const OwnRecordOptions& options) {
     record.entitlements = std::move(*entitlements);
   }
   const auto written = tasks.write(::getpid(), *startTime, record);
-  // Without the rights to write one, the daemon will say what it thinks of a process without.
-  if (!written && choosesAnother(options)) {
-    return fmt::format("cannot write a record: {}", written.error().message());
-  }
+  if (!written) return fmt::format("cannot write a record: {}", written.error().message());
   return std::nullopt;
 }

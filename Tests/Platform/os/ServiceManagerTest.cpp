@@ -48,8 +48,8 @@ TEST(ServiceManager, HandsOverListeningSocketsByName) {
   ASSERT_EQ(::bind(listening, reinterpret_cast<const sockaddr*>(&unnamed), sizeof(sa_family_t)), 0);
   ASSERT_EQ(::listen(listening, 1), 0);
   const int plain = ::socket(AF_UNIX, SOCK_STREAM, 0);
-  ASSERT_EQ(::dup2(::fcntl(plain, F_DUPFD, 10), 3), 3);
-  ASSERT_EQ(::dup2(::fcntl(listening, F_DUPFD, 10), 4), 4);
+  const int sources[] = {::fcntl(plain, F_DUPFD, 10), ::fcntl(listening, F_DUPFD, 10)};
+  for (int i = 0; i < 2; ++i) ASSERT_EQ(::dup2(sources[i], 3 + i), 3 + i);
   ::setenv("LISTEN_PID", std::to_string(::getpid()).c_str(), 1);
   ::setenv("LISTEN_FDS", "2", 1);
   ::setenv("LISTEN_FDNAMES", "first:second", 1);
