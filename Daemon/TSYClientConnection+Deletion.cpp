@@ -18,7 +18,7 @@ TSYResult<void> TSYClientConnection::_moveItemAtURLToDeathRow(const TSYURL& url,
                                      "Failed to create unique directory at: {}", url.path()));
   }
   const TSYURL target = directory->appending(url.lastPathComponent());
-  const auto moved = files.moveItemAtURL(url, target);
+  const auto moved = files.renameItemAtURL(url, target);
   if (!moved) {
     if (moved.error().isPosix(ENOENT)) return {};
     return TSYFailure(TSYErrorCreate(TSYErrorFileOperationFailed, moved.error(), TSYLogIt::yes,
@@ -65,7 +65,7 @@ TSYResult<void> TSYClientConnection::_removeItemOrMoveToTempAtURL(const TSYURL& 
   TSYLogWrite(TSYLogLevelDebug, "Couldn't remove, so moving item to /tmp: {} : {}", url.path(),
               removed.error());
   const TSYURL temporary = TSYGlobalConfiguration::sharedInstance().temporaryDirectory();
-  const auto moved = files.moveItemAtURL(url, temporary.appending(url.lastPathComponent()));
+  const auto moved = files.renameItemAtURL(url, temporary.appending(url.lastPathComponent()));
   if (moved) return {};
   return TSYFailure(TSYErrorCreate(TSYErrorMoveToTempFailed, moved.error(), TSYLogIt::yes,
                                    "Failed to move dir: {} to: {}", url.path(), temporary.path()));

@@ -2,6 +2,31 @@
 
 #include "Daemon/TSYLog.h"
 
+namespace {
+
+// The name in a function's signature: what stands between the return type and the arguments. Both
+// the return type and template arguments, which are left out, may hold spaces and names of their
+// own; some compilers write a pointer's star right before the name.
+std::string qualifiedName(std::string_view signature) {
+  std::string name;
+  int depth = 0;
+  for (const char c : signature) {
+    if (c == '<') ++depth;
+    if (depth == 0) {
+      if (c == '(') break;
+      if (c == ' ' || c == '*' || c == '&') {
+        name.clear();
+      } else {
+        name += c;
+      }
+    }
+    if (c == '>') --depth;
+  }
+  return name;
+}
+
+}  // namespace
+
 TSYError::TSYError(Details details)
     : details_(std::make_shared<const Details>(std::move(details))) {}
 
@@ -51,10 +76,7 @@ std::string TSYFunctionName(const std::source_location& location) {
       name.erase(at, anonymous.size());
     }
   }
-  name = name.substr(0, name.find('('));
-  // What precedes the qualified name is the return type, which may hold spaces of its own.
-  const size_t space = name.rfind(' ');
-  if (space != std::string::npos) name = name.substr(space + 1);
+  name = qualifiedName(name);
   const size_t operation = name.rfind("::");
   if (operation == std::string::npos) return name;
   const size_t outer = operation == 0 ? std::string::npos : name.rfind("::", operation - 1);

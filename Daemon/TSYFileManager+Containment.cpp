@@ -27,8 +27,9 @@ FileSystem& files() {
 // The part of a path below the root of the system.
 std::string_view belowRoot(std::string_view path) {
   const std::string& root = files().root();
-  const bool isBelow = path.starts_with(root) && path.substr(root.size()).starts_with('/');
-  return isBelow ? path.substr(root.size()) : path;
+  if (!path.starts_with(root)) return path;
+  const std::string_view below = path.substr(root.size());
+  return below.empty() || below.starts_with('/') ? below : path;
 }
 
 std::string_view withoutPrivate(std::string_view path) {

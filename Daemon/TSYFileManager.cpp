@@ -161,14 +161,17 @@ TSYResult<void> TSYFileManager::copyItemAtURL(const TSYURL& source, const TSYURL
                                         copied.error().message()));
 }
 
-TSYResult<void> TSYFileManager::moveItemAtURL(const TSYURL& source, const TSYURL& destination) {
+TSYResult<void> TSYFileManager::renameItemAtURL(const TSYURL& source, const TSYURL& destination) {
   const auto renamed = files().rename(source.path(), destination.path());
   if (renamed) return {};
-  if (renamed.error() != Errno{EXDEV}) {
-    return TSYFailure(TSYPosixErrorCreate(renamed.error(), "rename of {} to {} failed: {}",
-                                          source.path(), destination.path(),
-                                          renamed.error().message()));
-  }
+  return TSYFailure(TSYPosixErrorCreate(renamed.error(), "rename of {} to {} failed: {}",
+                                        source.path(), destination.path(),
+                                        renamed.error().message()));
+}
+
+TSYResult<void> TSYFileManager::moveItemAtURL(const TSYURL& source, const TSYURL& destination) {
+  auto renamed = renameItemAtURL(source, destination);
+  if (renamed || !renamed.error().isPosix(EXDEV)) return renamed;
   auto copied = copyItemAtURL(source, destination);
   if (!copied) return copied;
   const auto removed = removeItemAtURL(source);

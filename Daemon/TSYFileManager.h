@@ -40,6 +40,9 @@ class TSYFileManager {
   TSYResult<void> moveItemAtURL(const TSYURL& source, const TSYURL& destination);
   TSYResult<void> copyItemIfExistsAtURL(const TSYURL& source, const TSYURL& destination);
   TSYResult<void> moveItemIfExistsAtURL(const TSYURL& source, const TSYURL& destination);
+  // A move that never copies: what is only being got rid of stays where it is rather than be copied
+  // to another file system (EXDEV).
+  TSYResult<void> renameItemAtURL(const TSYURL& source, const TSYURL& destination);
 
   // Removes a whole tree, past every item that resists; the first error is the result. A missing
   // item is success.

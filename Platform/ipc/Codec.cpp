@@ -152,7 +152,7 @@ class Encoder {
 
   std::vector<uint8_t> bytes_;
   size_t depth_ = 0;
-  size_t values_ = 0;
+  size_t values_ = 1;  // the body's own map
   const char* failure_ = nullptr;
 };
 

@@ -20,7 +20,8 @@ inline constexpr size_t kFrameHeaderSize = 16;
 inline constexpr uint32_t kMaximumBodySize = 16 * 1024 * 1024;
 // Arrays and maps inside each other, the body's own map included.
 inline constexpr size_t kMaximumNesting = 64;
-// Values in one message, keys not counted: a byte of CBOR can become a value of 56.
+// Values in one message, the body's own map included, keys not: one byte of CBOR can become 56 in
+// memory.
 inline constexpr size_t kMaximumValues = 1024 * 1024;
 inline constexpr uint32_t kReplyFlag = 1;
 

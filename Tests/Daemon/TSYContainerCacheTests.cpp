@@ -67,13 +67,13 @@ TEST_F(ContainerCache, aScanTakesWhatIsAContainerOfTheClassAndNothingElse) {
   put(kApplications, "class-4", 4, personal);
   put(kApplications, "works", 2, user("E1"));
   const std::string outside = put("/elsewhere/Data/Application", "linked", 2, personal);
-  std::filesystem::create_symlink(device_.path(outside),
-                                  device_.path(std::string(kApplications) + "/" +
-                                               UUID::random().string()));
+  std::filesystem::create_symlink(
+      device_.path(outside),
+      device_.path(std::string(kApplications) + "/" + UUID::random().string()));
   device_.write(std::string(kApplications) + "/" + UUID::random().string(), "a file");
-  device_.write(std::string(kApplications) + "/" + UUID::random().string() + "/" +
-                    kTSYMetadataFileName,
-                "bplist00");
+  device_.write(
+      std::string(kApplications) + "/" + UUID::random().string() + "/" + kTSYMetadataFileName,
+      "bplist00");
   put(kSystem, "com.veltra.exampled", 12, global, "com.veltra.exampled");
   put(kSystem, "palette", 12, global, "systemgroup.com.veltra.palette");
   put("/private/var/containers/Shared/SystemGroup", "palette", 13, global,
@@ -148,15 +148,14 @@ TEST_F(ContainerCache, whichContainerTheSandboxShouldSee) {
     std::string identifier;
     TSYContainerClass class_;
     std::string registered;  // of personal, unspecific, E1, E2
-  } cases[] = {
-      {"com.nobody", 2, "PU"}, {"com.nobody", 4, "PU"}, {"com.work", 2, "1"},
-      {"com.both", 11, "PU"},  {"com.corp", 9, "12"},   {"com.work", 7, "PU12"},
-      {"com.corp", 12, "PU"},  {"com.corp", 13, "PU"},  {"com.work", 1, "PU"},
-      {"com.corp", 0, "PU"},   {"com.corp", 6, "12"},
-  };
-  const std::pair<char, TSYUserIdentityRef> identities[] = {
-      {'P', user("P")}, {'U', users_.unspecificUserIdentity()}, {'1', user("E1")},
-      {'2', user("E2")}};
+  } cases[] = {{"com.nobody", 2, "PU"}, {"com.nobody", 4, "PU"}, {"com.work", 2, "1"},
+               {"com.both", 11, "PU"},  {"com.corp", 9, "12"},   {"com.work", 7, "PU12"},
+               {"com.corp", 12, "PU"},  {"com.corp", 13, "PU"},  {"com.work", 1, "PU"},
+               {"com.corp", 0, "PU"},   {"com.corp", 6, "12"}};
+  const std::pair<char, TSYUserIdentityRef> identities[] = {{'P', user("P")},
+                                                            {'U', users_.unspecificUserIdentity()},
+                                                            {'1', user("E1")},
+                                                            {'2', user("E2")}};
   for (const auto& test : cases) {
     std::string registered;
     for (const auto& [name, identity] : identities) {
@@ -177,19 +176,17 @@ TEST_F(ContainerCache, theSandboxIsToldWhatIsAddedAndRemoved) {
     bool transient;
     bool updateSandbox;
     std::string mapping;  // none when empty
-  } cases[] = {
-      {"P", "com.a", 2, false, true, "501/100/1/com.a"},
-      {"P", "com.a", 7, false, true, "501/100/2/com.a"},
-      {"P", "com.a", 12, false, true, "0/100/4/com.a"},
-      {"P", "com.a", 13, false, true, "0/100/8/com.a"},
-      {"P", "com.a", 1, false, true, ""},
-      {"P", "com.a", 2, true, true, ""},
-      {"P", "com.a", 2, false, false, ""},
-      {"P", "com.work", 2, false, true, ""},
-      {"E1", "com.work", 10, false, true, "501/201/1/com.work"},
-      {"E1", "com.both", 2, false, true, ""},
-      {"E2", "a group", 7, false, true, "501/202/2/a group"},
-  };
+  } cases[] = {{"P", "com.a", 2, false, true, "501/100/1/com.a"},
+               {"P", "com.a", 7, false, true, "501/100/2/com.a"},
+               {"P", "com.a", 12, false, true, "0/100/4/com.a"},
+               {"P", "com.a", 13, false, true, "0/100/8/com.a"},
+               {"P", "com.a", 1, false, true, ""},
+               {"P", "com.a", 2, true, true, ""},
+               {"P", "com.a", 2, false, false, ""},
+               {"P", "com.work", 2, false, true, ""},
+               {"E1", "com.work", 10, false, true, "501/201/1/com.work"},
+               {"E1", "com.both", 2, false, true, ""},
+               {"E2", "a group", 7, false, true, "501/202/2/a group"}};
   for (const auto& test : cases) {
     const TSYMetadata metadata(concreteContainerOf(user(test.user), test.identifier, test.class_),
                                nullptr, TSYURL("/unused"), std::nullopt);
@@ -246,8 +243,7 @@ TEST_F(ContainerCache, anIdentityThatGoesIsForgotten) {
   EXPECT_EQ(device_.mappings().size(), 2U);
   users_.flush();
   EXPECT_EQ(device_.mappings().size(), 1U);
-  EXPECT_EQ(device_.read("/run/tessary/notifications/com.veltra.tessary.user-invalidated")[0],
-            '2');
+  EXPECT_EQ(device_.read("/run/tessary/notifications/com.veltra.tessary.user-invalidated")[0], '2');
   EXPECT_EQ(look(user("E1"), "com.corp", 2), 1U);
   EXPECT_EQ(look(user("P"), "late", 2), 21U) << "the personal identity stays";
   EXPECT_EQ(device_.mappings().size(), 3U);

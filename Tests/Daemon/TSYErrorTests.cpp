@@ -90,55 +90,43 @@ TEST(TSYError, exceptionsBecomeCode40) {
   EXPECT_EQ(TSYCatchingExceptions([]() -> TSYResult<int> { return 7; }).value_or(0), 7);
 }
 
-// What a function sees of itself.
+// What functions see of themselves.
 using Where = std::source_location;
-Where plainFunction(Where where = Where::current()) {
-  return where;
+const Where* pointerFunction(Where& where, void (*)(int), Where here = Where::current()) {
+  where = Where::current();
+  return here.line() == 0 ? nullptr : &where;
 }
 struct Outer {
   struct Inner {
     Inner() : where(Where::current()) {}
-    const Where& reference() const {
-      where = Where::current();
-      return where;
-    }
-    const Where* pointer(void (*)(int)) {
-      where = Where::current();
-      return &where;
-    }
-    mutable Where where;
+    Where where;
   };
+  Where& reference() { return where = Where::current(); }
   static std::pair<Where, unsigned long> pair() { return {Where::current(), 1}; }
-  template <typename T>
-  static Where generic(T) {
-    return Where::current();
-  }
-  Where lambda() {
+  static Where lambda() {
     return [] { return Where::current(); }();
   }
+  Where where;
 };
 template <typename Key, typename Value>
 struct Table {
-  Where operation() { return Where::current(); }
+  template <typename T>
+  std::pair<Key, Where> operation(T) {
+    return {Key(), Where::current()};
+  }
 };
 
 TEST(TSYError, functionNamesAreClassAndOperation) {
-  Outer::Inner inner;
+  Where where;
   const std::pair<std::string, std::string> cases[] = {
-      {TSYFunctionName(inner.where), "[Inner Inner]"},
-      {TSYFunctionName(inner.reference()), "[Inner reference]"},
-      {TSYFunctionName(*inner.pointer(nullptr)), "[Inner pointer]"},
+      {TSYFunctionName(*pointerFunction(where, nullptr)), "pointerFunction"},
+      {TSYFunctionName(Outer::Inner().where), "[Inner Inner]"},
+      {TSYFunctionName(Outer().reference()), "[Outer reference]"},
       {TSYFunctionName(Outer::pair().first), "[Outer pair]"},
-      {TSYFunctionName(Outer::generic(std::pair(1, 2UL))), "[Outer generic]"},
-      {TSYFunctionName(Outer().lambda()), "[Outer lambda]"},
-      {TSYFunctionName([](const Where& where = Where::current()) -> const Where& {
-         return where;
-       }(plainFunction())),
-       "[TSYError_functionNamesAreClassAndOperation_Test TestBody]"},
-  };
+      {TSYFunctionName(Outer::lambda()), "[Outer lambda]"},
+      {TSYFunctionName(Table<std::string, unsigned long>().operation(1UL).second),
+       "[Table operation]"}};
   for (const auto& [name, expected] : cases) EXPECT_EQ(name, expected);
-  EXPECT_EQ(TSYFunctionName(Table<std::string, unsigned long>().operation()).substr(0, 6),
-            "[Table");
 }
 
 TEST(TSYLog, withoutALogEveryMessageIsHandedOver) {
@@ -148,29 +136,11 @@ TEST(TSYLog, withoutALogEveryMessageIsHandedOver) {
   EXPECT_TRUE(TSYLogIsEnabled(TSYLogLevelDebug));
 }
 
-struct Counted {
-  int& formatted;
-};
-
-}  // namespace
-
-template <>
-struct fmt::formatter<Counted> : fmt::formatter<int> {
-  auto format(const Counted& counted, format_context& context) const {
-    return fmt::formatter<int>::format(++counted.formatted, context);
-  }
-};
-
-namespace {
-
-TEST(TSYLog, whatIsAboveTheThresholdIsNotFormatted) {
+TEST(TSYLog, whatIsAboveTheThresholdIsNotHandedOver) {
   ASSERT_TRUE(TSYLogOpen(logPath(), TSYLogLevelNotice, kRotation));
-  int formatted = 0;
-  TSYLogWrite(TSYLogLevelDebug, "{}", Counted{formatted});
-  EXPECT_EQ(formatted, 0);
-  TSYLogWrite(TSYLogLevelNotice, "{}", Counted{formatted});
-  TSYLogWrite(TSYLogLevelError, "{}", Counted{formatted});
-  EXPECT_EQ(formatted, 2);
+  TSYLogWrite(TSYLogLevelDebug, "debug");
+  TSYLogWrite(TSYLogLevelNotice, "notice");
+  TSYLogWrite(TSYLogLevelError, "error");
   EXPECT_EQ(linesOfLog().size(), 2U);
 }
 

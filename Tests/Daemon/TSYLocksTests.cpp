@@ -16,102 +16,72 @@ namespace {
 
 using namespace std::chrono_literals;
 
-enum class Lock { readA, writeA, readB, writeB, readAB, writeAB, readAll, writeAll, nothing };
+const TSYIdentifiers kBoth = {"b", "a", "b"};
 
-void take(Lock lock) {
-  switch (lock) {
-    case Lock::readA:
-      return TSYLockIdentifierForReading("a");
-    case Lock::writeA:
-      return TSYLockIdentifierForWriting("a");
-    case Lock::readB:
-      return TSYLockIdentifierForReading("b");
-    case Lock::writeB:
-      return TSYLockIdentifierForWriting("b");
-    case Lock::readAB:
-      return TSYLockIdentifiersForReading({"b", "a", "b"});
-    case Lock::writeAB:
-      return TSYLockIdentifiersForWriting({"b", "a", "b"});
-    case Lock::readAll:
-      return TSYLockAllIdentifiersForReading();
-    case Lock::writeAll:
-      return TSYLockAllIdentifiersForWriting();
-    case Lock::nothing:
-      return;
-  }
-}
+struct Lock {
+  std::string name;
+  std::function<void()> take;
+  std::function<void()> release;
+};
+const Lock nothing{"nothing", [] {}, [] {}};
+const Lock readA{"readA", [] { TSYLockIdentifierForReading("a"); },
+                 [] { TSYUnlockIdentifier("a"); }};
+const Lock writeA{"writeA", [] { TSYLockIdentifierForWriting("a"); }, readA.release};
+const Lock readB{"readB", [] { TSYLockIdentifierForReading("b"); },
+                 [] { TSYUnlockIdentifier("b"); }};
+const Lock writeB{"writeB", [] { TSYLockIdentifierForWriting("b"); }, readB.release};
+const Lock readAB{"readAB", [] { TSYLockIdentifiersForReading(kBoth); },
+                  [] { TSYUnlockIdentifiers(kBoth); }};
+const Lock writeAB{"writeAB", [] { TSYLockIdentifiersForWriting(kBoth); }, readAB.release};
+const Lock readAll{"readAll", TSYLockAllIdentifiersForReading, TSYUnlockAllIdentifiers};
+const Lock writeAll{"writeAll", TSYLockAllIdentifiersForWriting, TSYUnlockAllIdentifiers};
 
-void release(Lock lock) {
-  switch (lock) {
-    case Lock::readA:
-    case Lock::writeA:
-      return TSYUnlockIdentifier("a");
-    case Lock::readB:
-    case Lock::writeB:
-      return TSYUnlockIdentifier("b");
-    case Lock::readAB:
-    case Lock::writeAB:
-      return TSYUnlockIdentifiers({"b", "a", "b"});
-    case Lock::readAll:
-    case Lock::writeAll:
-      return TSYUnlockAllIdentifiers();
-    case Lock::nothing:
-      return;
-  }
+std::future<void> takenBySomebodyElse(const Lock& lock) {
+  return std::async(std::launch::async, [&lock] {
+    lock.take();
+    lock.release();
+  });
 }
 
 TEST(TSYLocks, whoWaitsForWhom) {
-  using enum Lock;
   const struct {
-    Lock held;
-    std::vector<Lock> proceeding;
-    std::vector<Lock> waiting;
+    const Lock& held;
+    std::vector<const Lock*> proceeding;
+    std::vector<const Lock*> waiting;
   } cases[] = {
-      {nothing, {readA, writeA, readAB, writeAB, readAll, writeAll}, {}},
-      {readA, {readA, writeB, readAB, readAll}, {writeA, writeAB, writeAll}},
-      {writeA, {readB, writeB}, {readA, writeA, readAB, writeAB, readAll, writeAll}},
-      {readAB, {readA, readB, readAll}, {writeA, writeB, writeAll}},
-      {readAll, {readA, readAB, readAll}, {writeA, writeAB, writeAll}},
-      {writeAll, {}, {readA, writeA, readAB, writeAB, readAll, writeAll}},
-  };
-  const auto takenBySomebodyElse = [](Lock lock) {
-    return std::async(std::launch::async, [lock] {
-      take(lock);
-      release(lock);
-    });
-  };
+      {nothing, {&readA, &writeA, &readAB, &writeAB, &readAll, &writeAll}, {}},
+      {readA, {&readA, &writeB, &readAB, &readAll}, {&writeA, &writeAB, &writeAll}},
+      {writeA, {&readB, &writeB}, {&readA, &writeA, &readAB, &writeAB, &readAll, &writeAll}},
+      {readAB, {&readA, &readB, &readAll}, {&writeA, &writeB, &writeAll}},
+      {readAll, {&readA, &readAB, &readAll}, {&writeA, &writeAB, &writeAll}},
+      {writeAll, {}, {&readA, &writeA, &readAB, &writeAB, &readAll, &writeAll}}};
   for (const auto& test : cases) {
-    const auto held = static_cast<int>(test.held);
-    take(test.held);
-    for (const Lock wanted : test.proceeding) {
-      EXPECT_EQ(takenBySomebodyElse(wanted).wait_for(20s), std::future_status::ready)
-          << static_cast<int>(wanted) << " beside " << held;
+    test.held.take();
+    for (const Lock* wanted : test.proceeding) {
+      EXPECT_EQ(takenBySomebodyElse(*wanted).wait_for(20s), std::future_status::ready)
+          << wanted->name << " beside " << test.held.name;
     }
-    for (const Lock wanted : test.waiting) {
-      auto taken = takenBySomebodyElse(wanted);
+    for (const Lock* wanted : test.waiting) {
+      auto taken = takenBySomebodyElse(*wanted);
       EXPECT_EQ(taken.wait_for(20ms), std::future_status::timeout)
-          << static_cast<int>(wanted) << " beside " << held;
-      release(test.held);
-      EXPECT_EQ(taken.wait_for(20s), std::future_status::ready) << "woken by " << held;
-      take(test.held);
+          << wanted->name << " beside " << test.held.name;
+      test.held.release();
+      EXPECT_EQ(taken.wait_for(20s), std::future_status::ready) << "woken by " << test.held.name;
+      test.held.take();
     }
-    release(test.held);
+    test.held.release();
   }
 }
 
 TEST(TSYLocks, severalWaitersOfEveryKindAreAllWoken) {
-  for (const Lock held : {Lock::writeAll, Lock::writeA}) {
-    take(held);
+  for (const Lock* held : {&writeAll, &writeA, &readAll}) {
+    held->take();
     std::vector<std::future<void>> waiters;
-    for (const Lock wanted : {Lock::writeAll, Lock::readAll, Lock::writeAll, Lock::readA,
-                              Lock::writeA, Lock::readAB, Lock::writeAB, Lock::readAll}) {
-      waiters.push_back(std::async(std::launch::async, [wanted] {
-        take(wanted);
-        release(wanted);
-      }));
+    for (const Lock* wanted : {&writeAll, &readAll, &writeAll, &readA, &writeA, &writeAB, &readB}) {
+      waiters.push_back(takenBySomebodyElse(*wanted));
     }
     std::this_thread::sleep_for(30ms);
-    release(held);
+    held->release();
     for (auto& waiter : waiters) EXPECT_EQ(waiter.wait_for(20s), std::future_status::ready);
   }
 }
@@ -207,31 +177,18 @@ TEST(TSYLocks, manyThreadsAtOnceKeepTheRules) {
 
 TEST(TSYLocksDeathTest, callsThatAreNotPairedStopTheProcess) {
   GTEST_FLAG_SET(death_test_style, "threadsafe");
-  const struct {
-    std::function<void()> calls;
-    std::string invariant;
-  } cases[] = {
-      {[] { TSYUnlockIdentifier("a"); }, "identifierToLockMap"},
-      {[] { TSYUnlockAllIdentifiers(); }, "allReaderWriterState > 0"},
-      {[] {
-         take(Lock::readA);
-         release(Lock::readA);
-         release(Lock::readA);
-       },
-       "identifierToLockMap"},
-      {[] {
-         take(Lock::writeA);
-         release(Lock::readB);
-       },
-       "identifierToLockMap"},
-      {[] {
-         take(Lock::readAll);
-         release(Lock::readAll);
-         release(Lock::readAll);
-       },
-       "allReaderWriterState > 0"},
+  const auto twice = [](const Lock& lock) {
+    lock.take();
+    lock.release();
+    lock.release();
   };
-  for (const auto& test : cases) EXPECT_DEATH(test.calls(), lastWords(test.invariant));
+  const std::string noRecord = lastWords("identifierToLockMap");
+  const std::string noGlobalLock = lastWords("allReaderWriterState > 0");
+  EXPECT_DEATH(readA.release(), noRecord);
+  EXPECT_DEATH(readAll.release(), noGlobalLock);
+  EXPECT_DEATH(twice(readA), noRecord);
+  EXPECT_DEATH(twice(writeAB), noRecord);
+  EXPECT_DEATH(twice(writeAll), noGlobalLock);
 }
 
 }  // namespace

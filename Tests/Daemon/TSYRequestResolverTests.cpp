@@ -49,20 +49,18 @@ TEST(TSYRequestResolvers, whoseContainerAnIdentifierMeans) {
     TSYContainerClass class_;
     std::string result;
     std::string logged;
-  } cases[] = {
-      {"unspecific", "com.nobody", 2, "personal", ""},
-      {"unspecific", "com.work", 2, "E1", ""},
-      {"unspecific", "com.work", 11, "E1", ""},
-      {"unspecific", "com.work", 6, "E1", ""},
-      {"unspecific", "com.both", 2, "unspecific", ""},
-      {"unspecific", "com.corp", 2, "unspecific", ""},
-      {"unspecific", "com.work", 1, "unspecific", ""},
-      {"unspecific", "com.work", 12, "unspecific", ""},
-      {"P", "com.work", 2, "personal", ""},
-      {"E2", "com.work", 2, "E2", ""},
-      {"none", "com.work", 2, "76", ""},
-      {"none", "com.work", 1, "76", ""},
-  };
+  } cases[] = {{"unspecific", "com.nobody", 2, "personal", ""},
+               {"unspecific", "com.work", 2, "E1", ""},
+               {"unspecific", "com.work", 11, "E1", ""},
+               {"unspecific", "com.work", 6, "E1", ""},
+               {"unspecific", "com.both", 2, "unspecific", ""},
+               {"unspecific", "com.corp", 2, "unspecific", ""},
+               {"unspecific", "com.work", 1, "unspecific", ""},
+               {"unspecific", "com.work", 12, "unspecific", ""},
+               {"P", "com.work", 2, "personal", ""},
+               {"E2", "com.work", 2, "E2", ""},
+               {"none", "com.work", 2, "76", ""},
+               {"none", "com.work", 1, "76", ""}};
   for (const auto& test : cases) {
     const TSYClientConnection connection =
         unentitledConnection(clientWith("com.client", user(test.client)));
@@ -97,8 +95,7 @@ TEST(TSYRequestResolvers, containerIdentitiesOfRequests) {
       {client, {{"Identifier", id}, {"ContainerClass", -1}}, {}, 20, "", ""},
       {client, {{"Identifier", id}, {"ContainerClass", UINT64_MAX}}, {}, 20, "", ""},
       {nobody, {{"Identifier", id}, {"ContainerClass", 2U}}, {}, 76, "", ""},
-      {nobody, {{"ContainerClass", 2U}}, TSYIdentifierFallback::client, 18, "", ""},
-  };
+      {nobody, {{"ContainerClass", 2U}}, TSYIdentifierFallback::client, 18, "", ""}};
   for (const auto& test : cases) {
     const auto identity =
         TSYResolveContainerIdentity(Message(test.request), test.client, test.fallback);
@@ -116,15 +113,19 @@ TEST(TSYRequestResolvers, personasOfRequests) {
     std::string client;
     std::optional<std::string> persona;
     std::string result;
-  } cases[] = {
-      {"unspecific", "P", "personal"}, {"unspecific", "E1", "E1"},
-      {"unspecific", "U", "unspecific"}, {"unspecific", std::nullopt, "unspecific"},
-      {"unspecific", "gone", "76"},    {"unspecific", "", "76"},
-      {"P", "P", "personal"},          {"P", "E1", "76"},
-      {"E1", "E1", "E1"},              {"E1", "E2", "76"},
-      {"E1", "P", "76"},               {"E1", std::nullopt, "76"},
-      {"none", "P", "76"},
-  };
+  } cases[] = {{"unspecific", "P", "personal"},
+               {"unspecific", "E1", "E1"},
+               {"unspecific", "U", "unspecific"},
+               {"unspecific", std::nullopt, "unspecific"},
+               {"unspecific", "gone", "76"},
+               {"unspecific", "", "76"},
+               {"P", "P", "personal"},
+               {"P", "E1", "76"},
+               {"E1", "E1", "E1"},
+               {"E1", "E2", "76"},
+               {"E1", "P", "76"},
+               {"E1", std::nullopt, "76"},
+               {"none", "P", "76"}};
   for (const auto& test : cases) {
     const TSYClientConnection connection =
         unentitledConnection(clientWith("com.client", user(test.client)));
@@ -159,7 +160,9 @@ TEST(TSYRequestResolvers, concreteContainerIdentitiesOfRequests) {
     EXPECT_EQ(identity->uuid(), uuid);
     return identity->identifier() + " " + identity->userIdentity()->identifier();
   };
-  Value::Dictionary request{{"Identifier", "com.app"}, {"ContainerClass", 2U}, {"UUID", uuid},
+  Value::Dictionary request{{"Identifier", "com.app"},
+                            {"ContainerClass", 2U},
+                            {"UUID", uuid},
                             {"PersonaUniqueString", "E2"}};
   EXPECT_EQ(resolve(request), "com.app E2");
   EXPECT_EQ(resolve(request, {.identifier = "Old"}), "18") << "no fallback to the client's own";
@@ -185,20 +188,18 @@ TEST(TSYRequestResolvers, tokensAreForSandboxedClientsOfEnterpriseContainers) {
     std::string owner;
     TSYContainerClass class_;
     std::string extensionClass;  // empty for no token
-  } cases[] = {
-      {true, "E1", 2, "com.veltra.sandbox.container"},
-      {true, "E1", 4, "com.veltra.sandbox.container"},
-      {true, "E1", 6, "com.veltra.sandbox.container"},
-      {true, "E1", 10, "com.veltra.sandbox.container"},
-      {true, "E1", 7, "com.veltra.sandbox.application-group"},
-      {true, "E1", 9, ""},
-      {true, "E1", 11, ""},
-      {true, "E1", 12, ""},
-      {true, "E1", 1, ""},
-      {true, "P", 2, ""},
-      {true, "unspecific", 7, ""},
-      {false, "E1", 2, ""},
-  };
+  } cases[] = {{true, "E1", 2, "com.veltra.sandbox.container"},
+               {true, "E1", 4, "com.veltra.sandbox.container"},
+               {true, "E1", 6, "com.veltra.sandbox.container"},
+               {true, "E1", 10, "com.veltra.sandbox.container"},
+               {true, "E1", 7, "com.veltra.sandbox.application-group"},
+               {true, "E1", 9, ""},
+               {true, "E1", 11, ""},
+               {true, "E1", 12, ""},
+               {true, "E1", 1, ""},
+               {true, "P", 2, ""},
+               {true, "unspecific", 7, ""},
+               {false, "E1", 2, ""}};
   std::filesystem::create_directories(device.path("/container"));
   for (const auto& test : cases) {
     const TSYMetadata container(concreteContainerOf(user(test.owner), "com.app", test.class_),

@@ -16,18 +16,16 @@ TEST(TSYWhitelist, wellKnownContainersDependOnTheClass) {
     std::string identifier;
     TSYContainerClass class_;
     bool wellKnown;
-  } cases[] = {
-      {"com.veltra.exampled", 12, true},
-      {"com.veltra.exampled", 13, false},
-      {"com.veltra.exampled", 2, false},
-      {"com.veltra.Exampled", 12, false},
-      {"systemgroup.com.veltra.palette", 13, true},
-      {"systemgroup.com.veltra.palette", 12, false},
-      {"systemgroup.com.veltra.palette", 7, false},
-      {kCoverage, 13, false},
-      {"", 12, false},
-      {"com.veltra.exampled", 14, false},
-  };
+  } cases[] = {{"com.veltra.exampled", 12, true},
+               {"com.veltra.exampled", 13, false},
+               {"com.veltra.exampled", 2, false},
+               {"com.veltra.Exampled", 12, false},
+               {"systemgroup.com.veltra.palette", 13, true},
+               {"systemgroup.com.veltra.palette", 12, false},
+               {"systemgroup.com.veltra.palette", 7, false},
+               {kCoverage, 13, false},
+               {"", 12, false},
+               {"com.veltra.exampled", 14, false}};
   for (const auto& test : cases) {
     EXPECT_EQ(list.containerIdIsWellknown(test.identifier, test.class_), test.wellKnown)
         << test.identifier << test.class_;
@@ -58,40 +56,20 @@ TEST(TSYWhitelist, lookupPermission) {
     TSYContainerClass class_;
     std::string container;
     bool allowed;
-  } cases[] = {
-      {"com.nobody", 10, "com.open", true}, {"", 10, "com.open", true},
-      {"com.nobody", 9, "com.open", false}, {"com.nobody", 10, "com.opened", false},
-      {"com.nobody", 0, "com.zero", true},  {"com.any", 1, "com.app", true},
-      {"com.any", 13, "x", true},           {"com.any", 14, "x", false},
-      {"com.any", ~0ULL, "x", false},       {"com.some", 2, "com.app", true},
-      {"com.some", 2, "com.other", true},   {"com.some", 2, "com.third", false},
-      {"com.some", 4, "com.app", false},    {"com.some", 7, "anything", true},
-      {"com.Some", 2, "com.app", false},
-  };
+  } cases[] = {{"com.nobody", 10, "com.open", true}, {"", 10, "com.open", true},
+               {"com.nobody", 9, "com.open", false}, {"com.nobody", 10, "com.opened", false},
+               {"com.nobody", 0, "com.zero", true},  {"com.any", 1, "com.app", true},
+               {"com.any", 13, "x", true},           {"com.any", 14, "x", false},
+               {"com.any", ~0ULL, "x", false},       {"com.some", 2, "com.app", true},
+               {"com.some", 2, "com.other", true},   {"com.some", 2, "com.third", false},
+               {"com.some", 4, "com.app", false},    {"com.some", 7, "anything", true},
+               {"com.Some", 2, "com.app", false}};
   for (const auto& test : cases) {
     EXPECT_EQ(
         list.isLookupWhitelistedFromCodeSignIdentifier(test.asker, test.class_, test.container),
         test.allowed)
         << test.asker << " " << test.class_ << " " << test.container;
   }
-}
-
-TEST(TSYWhitelist, theBuiltInRightsAreThoseOfTheSystemsComponents) {
-  const TestPlatform platform;
-  const TSYWhitelist& list = TSYWhitelist::sharedWhitelist();
-  const auto may = [&](const char* asker, TSYContainerClass class_, const char* container) {
-    return list.isLookupWhitelistedFromCodeSignIdentifier(asker, class_, container);
-  };
-  for (const char* asker : {"com.veltra.hatcheryd", "com.veltra.vaultd", "com.veltra.porterd",
-                            "com.veltra.herald", "com.veltra.stewardd", "com.veltra.mendd"}) {
-    EXPECT_TRUE(may(asker, 2, "com.example.app")) << asker;
-  }
-  EXPECT_TRUE(may("com.example.app", 10, "com.veltra.beacond"));
-  EXPECT_TRUE(may("com.veltra.examplewidget", 2, "com.veltra.exampleapp"));
-  EXPECT_TRUE(may("com.veltra.seekerd", 2, "com.veltra.notebook"));
-  EXPECT_TRUE(may("com.veltra.shelfd", 7, "group.com.veltra.shelf"));
-  EXPECT_FALSE(may("com.veltra.shelfd", 2, "group.com.veltra.shelf"));
-  EXPECT_FALSE(may("com.veltra.exampleapp", 2, "com.veltra.notebook"));
 }
 
 }  // namespace

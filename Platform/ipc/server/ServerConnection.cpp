@@ -159,7 +159,8 @@ void ServerConnection::send(std::vector<uint8_t> frame) {
   std::span<const uint8_t> rest(frame);
   if (!hasOutput() && !sendNow(rest)) return;
   if (rest.empty()) return;
-  keep(std::move(frame), frame.size() - rest.size());
+  const size_t alreadySent = frame.size() - rest.size();
+  keep(std::move(frame), alreadySent);
   if (ended_ || onTurn_) return;
   watch();
   core_->pool().arm(socket_.get(), token_, EPOLLOUT);

@@ -137,18 +137,6 @@ TEST(SerialQueue, EndingRunsWhatWasHandedInAndDropsWhatIsSuspended) {
   }
 }
 
-TEST(SerialQueue, WorkMayHandInMoreWorkWhileTheQueueEnds) {
-  std::atomic<int> ran = 0;
-  {
-    SerialQueue queue("com.example.ending");
-    queue.async([&] {
-      std::this_thread::sleep_for(30ms);  // until the end has begun
-      queue.async([&] { ++ran; });
-    });
-  }
-  EXPECT_EQ(ran, 1);
-}
-
 TEST(SerialQueue, ManyThreadsNeverMeetOnIt) {
   constexpr int kThreads = 6;
   constexpr int kRounds = 300;

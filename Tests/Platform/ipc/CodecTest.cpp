@@ -188,12 +188,12 @@ TEST(CodecTest, KeepsToItsLimitsInBothDirections) {
   EXPECT_FALSE(decodeMessage(bodyWith(repeated("81", kMaximumNesting) + "00")));
   EXPECT_FALSE(decodeMessage(bodyWith(repeated("9f", kMaximumBodySize / 16))));
 
-  message.set("A", Value::Array(kMaximumValues - 1));
+  message.set("A", Value::Array(kMaximumValues - 2));
   EXPECT_TRUE(decodeMessage(encodedBody(message)));
-  message.set("A", Value::Array(kMaximumValues));
+  message.set("A", Value::Array(kMaximumValues - 1));
   EXPECT_FALSE(encodeFrame(message, 1, 0));
   std::vector<uint8_t> manyNulls = bodyWith("9f");
-  manyNulls.resize(manyNulls.size() + kMaximumValues, 0xF6);
+  manyNulls.resize(manyNulls.size() + kMaximumValues - 1, 0xF6);
   manyNulls.push_back(0xFF);
   EXPECT_FALSE(decodeMessage(manyNulls));
 

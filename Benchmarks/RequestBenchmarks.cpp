@@ -1,0 +1,95 @@
+// Requests beside a bare echo server on the same kind of socket, in turns, so that a drift of the
+// machine's speed meets both.
+
+#include <benchmark/benchmark.h>
+
+#include <atomic>
+#include <memory>
+#include <thread>
+
+#include "Benchmarks/Samples.h"
+#include "Benchmarks/Scratch.h"
+
+namespace {
+
+using Clock = std::chrono::steady_clock;
+
+// One container that is there, and an echo server for frames of the size of its lookup.
+struct LookupSetUp {
+  LookupSetUp() {
+    device.start();
+    const platform::FileDescriptor socket = device.connect();
+    roundTripOfFrame(socket.get(), createFrame("com.example.application"));
+    request = lookupFrame("com.example.application");
+    replySize = roundTripOfFrame(socket.get(), request).size();
+    echo = std::make_unique<EchoServer>(request.size(), replySize);
+  }
+
+  ScratchDevice device;
+  std::vector<uint8_t> request;
+  size_t replySize = 0;
+  std::unique_ptr<EchoServer> echo;
+};
+
+void lookupRoundTrip(benchmark::State& state) {
+  constexpr int kRounds = 20'000;
+  const LookupSetUp setUp;
+  const platform::FileDescriptor daemon = setUp.device.connect();
+  const platform::FileDescriptor bare = setUp.echo->connect();
+  for (auto _ : state) {
+    Samples lookups;
+    Samples echoes;
+    for (int i = 0; i < kRounds; ++i) {
+      lookups.time([&] { roundTrip(daemon.get(), setUp.request, setUp.replySize); });
+      echoes.time([&] { roundTrip(bare.get(), setUp.request, setUp.replySize); });
+    }
+    state.counters["p50_us"] = lookups.median();
+    state.counters["p99_us"] = lookups.percentile(0.99);
+    state.counters["echo_p50_us"] = echoes.median();
+    state.counters["echo_p99_us"] = echoes.percentile(0.99);
+    state.counters["ratio_p50"] = lookups.median() / echoes.median();
+  }
+}
+BENCHMARK(lookupRoundTrip)->Iterations(1)->Unit(benchmark::kMillisecond);
+
+// Requests per second of so many clients, each with a connection and a thread of his own.
+template <typename Connect>
+double throughput(const LookupSetUp& setUp, int clients, Connect&& connect) {
+  constexpr std::chrono::milliseconds kDuration{1'000};
+  std::atomic<bool> over = false;
+  std::atomic<uint64_t> total = 0;
+  std::vector<std::thread> threads;
+  const auto start = Clock::now();
+  for (int i = 0; i < clients; ++i) {
+    threads.emplace_back([&, socket = connect()] {
+      uint64_t count = 0;
+      for (; !over; ++count) roundTrip(socket.get(), setUp.request, setUp.replySize);
+      total += count;
+    });
+  }
+  std::this_thread::sleep_for(kDuration);
+  over = true;
+  for (std::thread& thread : threads) thread.join();
+  const std::chrono::duration<double> taken = Clock::now() - start;
+  return static_cast<double>(total) / taken.count();
+}
+
+void requestsPerSecond(benchmark::State& state) {
+  constexpr int kRounds = 3;
+  const int clients = static_cast<int>(state.range(0));
+  const LookupSetUp setUp;
+  for (auto _ : state) {
+    double daemon = 0;
+    double bare = 0;
+    for (int i = 0; i < kRounds; ++i) {
+      daemon += throughput(setUp, clients, [&] { return setUp.device.connect(); }) / kRounds;
+      bare += throughput(setUp, clients, [&] { return setUp.echo->connect(); }) / kRounds;
+    }
+    state.counters["per_s"] = daemon;
+    state.counters["echo_per_s"] = bare;
+    state.counters["ratio"] = daemon / bare;
+  }
+}
+BENCHMARK(requestsPerSecond)->Arg(1)->Arg(8)->Iterations(1)->Unit(benchmark::kMillisecond);
+
+}  // namespace

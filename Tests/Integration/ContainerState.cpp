@@ -1,0 +1,133 @@
+#include "Tests/Integration/ContainerState.h"
+
+#include <fmt/format.h>
+#include <sys/stat.h>
+#include <sys/xattr.h>
+
+#include <algorithm>
+#include <array>
+#include <chrono>
+#include <filesystem>
+#include <fstream>
+#include <iterator>
+#include <thread>
+
+#include "Platform/values/PropertyList.h"
+#include "Platform/values/UUID.h"
+
+using platform::UUID;
+using platform::Value;
+
+namespace {
+
+constexpr char kMetadataFile[] = "/.com.veltra.tessary.metadata.plist";
+constexpr char kUserContainers[] = "/private/var/mobile/Containers";
+constexpr char kGlobalContainers[] = "/private/var/containers";
+constexpr char kCaches[] = "/private/var/root/Library/Caches/com.veltra.tessaryd";
+constexpr std::chrono::seconds kPatience{20};
+
+std::string attribute(const std::string& path, const char* name) {
+  std::array<unsigned char, 256> value{};
+  const ssize_t length = ::lgetxattr(path.c_str(), name, value.data(), value.size());
+  std::string text;
+  for (ssize_t i = 0; i < length; ++i) text += fmt::format("{:02x}", value[static_cast<size_t>(i)]);
+  return text;
+}
+
+std::string lookOf(const std::string& path) {
+  struct stat status{};
+  if (::lstat(path.c_str(), &status) != 0) return "missing";
+  return fmt::format("{:o} {}:{} class {} access {} default {}", status.st_mode, status.st_uid,
+                     status.st_gid, attribute(path, "trusted.tessary.protection-class"),
+                     attribute(path, "system.posix_acl_access"),
+                     attribute(path, "system.posix_acl_default"));
+}
+
+std::string metadataDefect(const Creation& creation, const std::string& file) {
+  std::ifstream stream(file, std::ios::binary);
+  const std::vector<uint8_t> bytes{std::istreambuf_iterator<char>(stream), {}};
+  const auto value = platform::readPropertyList(bytes);
+  if (!value || value->asDictionary() == nullptr) return "no property list: " + file;
+  const auto text = [&](const char* key) {
+    const auto found = value->asDictionary()->find(key);
+    return found == value->asDictionary()->end() ? std::string("missing")
+                                                 : found->second.description();
+  };
+  if (text("TSYMetadataIdentifier") != Value(creation.identifier).description() ||
+      text("TSYMetadataContentClass") != Value(creation.containerClass).description() ||
+      !UUID::parse(text("TSYMetadataUUID"))) {
+    return "not its own metadata: " + value->description();
+  }
+  return {};
+}
+
+}  // namespace
+
+std::string Creation::classDirectory() const {
+  const std::string base = containerClass < 12 ? kUserContainers : kGlobalContainers;
+  const char* const name = containerClass == 2    ? "/Data/Application"
+                           : containerClass == 12 ? "/Data/System"
+                                                  : "/Shared/SystemGroup";
+  return base + (transient ? "/Temp" : "") + name;
+}
+
+std::string Creation::stagingDirectory() const {
+  return std::string(containerClass < 12 ? kUserContainers : kCaches) + "/Staging";
+}
+
+tessary::Result<tessary::Container> Creation::request(tessary::Client& client) const {
+  return client.createOrLookup(identifier, containerClass,
+                               {.createIfNecessary = true, .transient = transient});
+}
+
+tessary::Result<tessary::Container> Creation::lookUp(tessary::Client& client) const {
+  return client.createOrLookup(identifier, containerClass);
+}
+
+std::vector<std::string> itemsIn(const Device& device, const std::string& directory) {
+  std::vector<std::string> names;
+  std::error_code missing;
+  for (const auto& item :
+       std::filesystem::directory_iterator(device.path(directory), missing)) {
+    names.push_back(item.path().filename());
+  }
+  std::ranges::sort(names);
+  return names;
+}
+
+std::map<std::string, std::string> pictureOf(const std::string& container) {
+  std::map<std::string, std::string> picture{{"", lookOf(container)}};
+  std::error_code missing;
+  for (const auto& item : std::filesystem::recursive_directory_iterator(container, missing)) {
+    const std::string path = item.path();
+    picture.emplace(path.substr(container.size()), lookOf(path));
+  }
+  return picture;
+}
+
+std::string defectOf(const Creation& creation, const std::string& path,
+                     const std::map<std::string, std::string>& model) {
+  const auto picture = pictureOf(path);
+  for (const auto& [name, look] : model) {
+    const auto found = picture.find(name);
+    if (found == picture.end()) return path + ": no " + name;
+    if (found->second != look) {
+      return fmt::format("{}: {} is {} and should be {}", path, name, found->second, look);
+    }
+  }
+  if (picture.size() != model.size()) return path + ": too much in it";
+  return metadataDefect(creation, path + kMetadataFile);
+}
+
+bool comesToBeClean(const Device& device, const Creation& creation, const std::string& passedOver) {
+  const auto deadline = std::chrono::steady_clock::now() + kPatience;
+  for (;;) {
+    const auto staged = itemsIn(device, creation.stagingDirectory());
+    const bool isClean =
+        itemsIn(device, kDeathRow).empty() && std::ranges::all_of(staged, [&](const auto& name) {
+          return name.starts_with(passedOver);
+        });
+    if (isClean || std::chrono::steady_clock::now() > deadline) return isClean;
+    std::this_thread::sleep_for(std::chrono::milliseconds(1));
+  }
+}

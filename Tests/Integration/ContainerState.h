@@ -1,0 +1,41 @@
+// What creations leave on the disk: whole containers, and litter on its way to removal. For tests
+// that interrupt creations.
+#pragma once
+
+#include <map>
+#include <string>
+#include <vector>
+
+#include "Tests/Integration/Device.h"
+
+// One kind of creation request.
+struct Creation {
+  uint64_t containerClass = 2;
+  std::string identifier = "com.example.app";
+  bool transient = false;
+
+  // Below the device's root.
+  std::string classDirectory() const;
+  std::string stagingDirectory() const;
+  tessary::Result<tessary::Container> request(tessary::Client& client) const;
+  tessary::Result<tessary::Container> lookUp(tessary::Client& client) const;
+};
+
+constexpr char kDeathRow[] = "/private/var/root/Library/Caches/com.veltra.tessaryd/Dead";
+
+// The names in a directory of the device, sorted; none when it is not there.
+std::vector<std::string> itemsIn(const Device& device, const std::string& directory);
+
+// Every item of a container, "" being itself, with its type, mode, owner, protection class and
+// access-control lists.
+std::map<std::string, std::string> pictureOf(const std::string& container);
+
+// What is wrong with the container at `path` of the disk; empty when it is whole, which is: it
+// looks like `model`, and its metadata file is valid and its own.
+std::string defectOf(const Creation& creation, const std::string& path,
+                     const std::map<std::string, std::string>& model);
+
+// Whether staging and death row come to be empty within some seconds. `passedOver` begins the names
+// of items in staging that may stay.
+bool comesToBeClean(const Device& device, const Creation& creation,
+                    const std::string& passedOver = "(none)");
