@@ -28,6 +28,8 @@ template <typename T>
 class [[nodiscard]] Result : public std::expected<T, Errno> {
  public:
   using std::expected<T, Errno>::expected;
+  // Written out because GCC 12 takes the inherited one to leave something uninitialised.
+  constexpr Result() {}
 };
 
 }  // namespace platform

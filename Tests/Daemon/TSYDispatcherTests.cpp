@@ -2,6 +2,9 @@
 
 #include <gtest/gtest.h>
 
+#include <array>
+#include <set>
+
 #include "Tests/Daemon/ContainerDevice.h"
 
 namespace {
@@ -11,49 +14,26 @@ using platform::Value;
 const std::string kPrefix = "com.veltra.private.Tessary.";
 
 TEST(TSYCommandTable, theRows) {
-  // Flags: repliesOnReturn, allowUnentitled, consultsLookup.
-  const struct {
-    uint64_t first, last;
-    std::string entitlement;
-    std::string flags;
-  } expected[] = {{0, 0, "allowed", "111"},
-                  {1, 1, "allowed", "101"},
-                  {2, 3, "allowed", "100"},
-                  {4, 4, "userManagedAssets", "000"},
-                  {5, 10, "allowed", "100"},
-                  {11, 11, "wipeContainer", "100"},
-                  {12, 12, "deleteContainerContent", "100"},
-                  {13, 13, "allowed", "111"},
-                  {14, 14, "allowed", "101"},
-                  {15, 17, "allowed", "111"},
-                  {18, 20, "allowed", "100"},
-                  {21, 21, "allowed", "000"},
-                  {22, 22, "allowed", "100"},
-                  {23, 23, "allowed", "101"},
-                  {24, 24, "dataMigration", "100"},
-                  {25, 25, "testability", "100"},
-                  {26, 26, "stageSharedContent", "100"},
-                  {27, 27, "allowed", "100"},
-                  {28, 28, "userManagedAssets", "110"},
-                  {29, 29, "userManagedAssets", "100"},
-                  {30, 30, "allowed", "100"},
-                  {31, 31, "testability", "100"},
-                  {32, 32, "allowed", "111"}};
-  uint64_t command = 0;
-  for (const auto& rows : expected) {
-    ASSERT_EQ(rows.first, command);
-    for (; command <= rows.last; ++command) {
-      const TSYCommandRow& row = TSYCommandTable().at(command);
-      EXPECT_EQ(row.command, command);
-      EXPECT_NE(row.handler, nullptr);
-      EXPECT_EQ(row.entitlement, kPrefix + rows.entitlement) << command;
-      EXPECT_EQ(
-          fmt::format("{:d}{:d}{:d}", row.repliesOnReturn, row.allowUnentitled, row.consultsLookup),
-          rows.flags)
-          << command;
-    }
+  // Rows that are not named here are "allowed" and only reply on return.
+  const std::map<uint64_t, std::string> entitlements = {
+      {4, "userManagedAssets"},  {11, "wipeContainer"},     {12, "deleteContainerContent"},
+      {24, "dataMigration"},     {25, "testability"},       {26, "stageSharedContent"},
+      {28, "userManagedAssets"}, {29, "userManagedAssets"}, {31, "testability"}};
+  const std::set<uint64_t> deferred = {4, 21};
+  const std::set<uint64_t> unentitled = {0, 13, 15, 16, 17, 28, 32};
+  const std::set<uint64_t> lookup = {0, 1, 13, 14, 15, 16, 17, 23, 32};
+  ASSERT_EQ(TSYCommandTable().size(), 33U);
+  for (uint64_t command = 0; command < 33; ++command) {
+    const TSYCommandRow& row = TSYCommandTable()[command];
+    const auto entitlement = entitlements.find(command);
+    EXPECT_EQ(row.command, command);
+    EXPECT_NE(row.handler, nullptr);
+    EXPECT_EQ(row.entitlement,
+              kPrefix + (entitlement == entitlements.end() ? "allowed" : entitlement->second));
+    EXPECT_EQ(row.repliesOnReturn, !deferred.contains(command)) << command;
+    EXPECT_EQ(row.allowUnentitled, unentitled.contains(command)) << command;
+    EXPECT_EQ(row.consultsLookup, lookup.contains(command)) << command;
   }
-  EXPECT_EQ(command, TSYCommandTable().size());
 }
 
 // Each letter stands for one entitlement.
@@ -84,38 +64,39 @@ Value::Dictionary entitlementsOf(const std::string& letters) {
 
 TEST(TSYDispatcher, whatEntitlementsComeTo) {
   const ContainerDevice device;
-  const struct {
-    size_t command;
-    std::string entitlements;  // "-" for no identity
-    // "refused", or: entitled, other identifiers, unrestricted, lookup, wipe list.
-    std::string rights;
-  } cases[] = {
-      {0, "a", "Eou"},      {0, "1", "Eou"},      {0, "al", "Eou"},    {0, "", ""},
-      {0, "o", "o"},        {0, "l", "l"},        {0, "ol", "ol"},     {0, "L", ""},
-      {0, "0", ""},         {0, "s", ""},         {0, "w", ""},        {0, "-", ""},
-      {1, "a", "Eou"},      {1, "", "refused"},   {1, "o", "refused"}, {1, "l", "l"},
-      {1, "e", ""},         {1, "L", "refused"},  {1, "-", "refused"}, {2, "a", "Eou"},
-      {2, "1", "Eou"},      {2, "0", "refused"},  {2, "s", "refused"}, {2, "l", "refused"},
-      {2, "o", "refused"},  {2, "-", "refused"},  {4, "m", "E"},       {4, "om", "Eo"},
-      {4, "a", "Eou"},      {4, "M", "refused"},  {4, "l", "refused"}, {11, "a", "Eou"},
-      {11, "aw", "Eouw"},   {11, "w", "Ew"},      {11, "ow", "Eow"},   {11, "W", "refused"},
-      {11, "aW", "Eou"},    {11, "l", "refused"}, {11, "", "refused"}, {24, "d", "E"},
-      {24, "a", "Eou"},     {25, "a", "refused"}, {25, "at", "Eo"},    {25, "t", "E"},
-      {25, "-", "refused"}, {31, "a", "refused"}, {31, "at", "Eo"},    {28, "", ""},
-      {28, "m", "E"},       {28, "l", ""},        {28, "a", "Eou"},    {28, "-", ""},
-      {32, "l", "l"},       {32, "", ""},         {32, "a", "Eou"},    {32, "-", ""}};
+  // "entitlements=rights" for each client, "-" without an identity. Rights: entitled, other
+  // identifiers, unrestricted, lookup, wipe list; "x" when the client is refused.
+  const std::pair<size_t, std::string> cases[] = {
+      {0, "a=Eou 1=Eou al=Eou = o=o l=l ol=ol L= 0= s= w= -="},
+      {1, "a=Eou =x o=x l=l e= L=x -=x"},
+      {2, "a=Eou 1=Eou 0=x s=x l=x o=x -=x"},
+      {4, "m=E om=Eo a=Eou M=x l=x"},
+      {11, "a=Eou aw=Eouw w=Ew ow=Eow W=x aW=Eou l=x =x"},
+      {24, "d=E a=Eou"},
+      {25, "a=x at=Eo t=E -=x"},
+      {28, "= m=E l= a=Eou -="},
+      {31, "a=x at=Eo"},
+      {32, "l=l = a=Eou -="}};
   size_t refusedClients = 0;
-  for (const auto& test : cases) {
-    SCOPED_TRACE(fmt::format("{} {}", test.command, test.entitlements));
+  std::vector<std::array<std::string, 3>> requests;
+  for (const auto& [command, clients] : cases) {
+    std::istringstream list(clients);
+    for (std::string client; list >> client;) {
+      const size_t equals = client.find('=');
+      requests.push_back(
+          {std::to_string(command), client.substr(0, equals), client.substr(equals + 1)});
+    }
+  }
+  for (const auto& [command, entitlements, expected] : requests) {
+    SCOPED_TRACE(command + " " + entitlements);
     const TSYUserIdentityRef user = TSYUserIdentityCache::defaultUserIdentity();
     const TSYClientIdentityRef client =
-        test.entitlements == "-"
-            ? nullptr
-            : clientWith("com.client", user, entitlementsOf(test.entitlements));
+        entitlements == "-" ? nullptr
+                            : clientWith("com.client", user, entitlementsOf(entitlements));
     const auto queue = std::make_shared<TSYCommandQueue>();
-    const auto connection = checkEntitlementsAndInitClientObject(TSYCommandTable()[test.command],
-                                                                 client, /*pid=*/4711, queue);
-    ASSERT_EQ(connection == nullptr, test.rights == "refused");
+    const auto connection = checkEntitlementsAndInitClientObject(
+        TSYCommandTable().at(std::stoul(command)), client, /*pid=*/4711, queue);
+    ASSERT_EQ(connection == nullptr, expected == "x");
     if (!connection) {
       if (client) ++refusedClients;
       continue;
@@ -126,14 +107,14 @@ TEST(TSYDispatcher, whatEntitlementsComeTo) {
     if (connection->unrestricted()) rights += 'u';
     if (connection->isEntitledForLookupWithClass(2, "com.listed")) rights += 'l';
     if (connection->entitledWipeIdentifiers()) rights += 'w';
-    EXPECT_EQ(rights, test.rights);
+    EXPECT_EQ(rights, expected);
     EXPECT_EQ(connection->clientIdentity(), client);
     EXPECT_EQ(&connection->commandQueue(), queue.get());
     EXPECT_FALSE(connection->allowGroupIdLookup());
   }
   EXPECT_EQ(device.countInLog("connection attempt from pid 4711 (com.client) is not entitled"),
             refusedClients);
-  EXPECT_EQ(device.countInLog("connection attempt from pid 4711 ((null)) is not entitled"), 3U);
+  EXPECT_EQ(device.countInLog("connection attempt from pid 4711 ((null)) is not entitled"), 2U);
   EXPECT_EQ(device.countInLog("No entitled containers to wipe"), 5U);
 }
 

@@ -77,13 +77,6 @@ TEST(TSYMetadata, whatIsWrittenIsRead) {
     ASSERT_EQ(metadata->info() != nullptr, test.info != nullptr);
     if (test.info) EXPECT_EQ(*metadata->info(), *test.info);
 
-    const std::string bytes = device.read(kFile);
-    const auto file = platform::readBinaryPropertyList(
-        {reinterpret_cast<const uint8_t*>(bytes.data()), bytes.size()});
-    ASSERT_TRUE(file.has_value());
-    ASSERT_NE(file->find("TSYMetadataVersion"), nullptr);
-    EXPECT_EQ(*file->find("TSYMetadataVersion"), Value("2"));
-    EXPECT_EQ(file->find("TSYMetadataUserIdentity") != nullptr, !TSYIsGlobalClass(test.class_));
     EXPECT_EQ(TSYFileManager::defaultManager()
                   .dataProtectionClassOfItemAtURL(TSYURL(device.path(kFile)))
                   .value_or(-1),

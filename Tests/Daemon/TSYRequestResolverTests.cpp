@@ -43,32 +43,26 @@ TEST(TSYRequestResolvers, theClientsOwnIdentifierStandsIn) {
 
 TEST(TSYRequestResolvers, whoseContainerAnIdentifierMeans) {
   const ContainerDevice device(workPersonas());
+  const std::vector<std::string> identifiers = {"com.nobody", "com.work", "com.both", "com.corp"};
   const struct {
     std::string client;
-    std::string identifier;
-    TSYContainerClass class_;
-    std::string result;
-    std::string logged;
-  } cases[] = {{"unspecific", "com.nobody", 2, "personal", ""},
-               {"unspecific", "com.work", 2, "E1", ""},
-               {"unspecific", "com.work", 11, "E1", ""},
-               {"unspecific", "com.work", 6, "E1", ""},
-               {"unspecific", "com.both", 2, "unspecific", ""},
-               {"unspecific", "com.corp", 2, "unspecific", ""},
-               {"unspecific", "com.work", 1, "unspecific", ""},
-               {"unspecific", "com.work", 12, "unspecific", ""},
-               {"P", "com.work", 2, "personal", ""},
-               {"E2", "com.work", 2, "E2", ""},
-               {"none", "com.work", 2, "76", ""},
-               {"none", "com.work", 1, "76", ""}};
+    std::vector<std::string> ofUserClass;  // for each of the identifiers
+    std::string ofGlobalClass;
+  } cases[] = {{"unspecific", {"personal", "E1", "unspecific", "unspecific"}, "unspecific"},
+               {"P", {"personal", "personal", "personal", "personal"}, "personal"},
+               {"E2", {"E2", "E2", "E2", "E2"}, "E2"},
+               {"none", {"76", "76", "76", "76"}, "76"}};
   for (const auto& test : cases) {
     const TSYClientConnection connection =
         unentitledConnection(clientWith("com.client", user(test.client)));
-    EXPECT_EQ(nameOf(TSYResolveUserIdentityForIdentifier(connection, test.identifier, test.class_)),
-              test.result)
-        << test.client << " " << test.identifier << " " << test.class_;
+    for (TSYContainerClass class_ = 1; class_ < kTSYContainerClassMax; ++class_) {
+      for (size_t i = 0; i < identifiers.size(); ++i) {
+        EXPECT_EQ(nameOf(TSYResolveUserIdentityForIdentifier(connection, identifiers[i], class_)),
+                  TSYIsPerUserClass(class_) ? test.ofUserClass[i] : test.ofGlobalClass)
+            << test.client << " " << identifiers[i] << " " << class_;
+      }
+    }
   }
-  EXPECT_EQ(device.countInLog("Chose bundleIdentifier: com.corp, userIdentities: {("), 1U);
   const TSYClientConnection nobody = unentitledConnection(nullptr);
   EXPECT_EQ(nameOf(TSYResolveUserIdentityForIdentifier(nobody, "com.work", 2)), "76");
 }
@@ -109,31 +103,23 @@ TEST(TSYRequestResolvers, containerIdentitiesOfRequests) {
 
 TEST(TSYRequestResolvers, personasOfRequests) {
   const ContainerDevice device(workPersonas());
-  const struct {
-    std::string client;
-    std::optional<std::string> persona;
-    std::string result;
-  } cases[] = {{"unspecific", "P", "personal"},
-               {"unspecific", "E1", "E1"},
-               {"unspecific", "U", "unspecific"},
-               {"unspecific", std::nullopt, "unspecific"},
-               {"unspecific", "gone", "76"},
-               {"unspecific", "", "76"},
-               {"P", "P", "personal"},
-               {"P", "E1", "76"},
-               {"E1", "E1", "E1"},
-               {"E1", "E2", "76"},
-               {"E1", "P", "76"},
-               {"E1", std::nullopt, "76"},
-               {"none", "P", "76"}};
-  for (const auto& test : cases) {
+  const std::optional<std::string> personas[] = {"P", "E1", "E2", "U", "gone", "", std::nullopt};
+  const std::pair<std::string, std::vector<std::string>> cases[] = {
+      {"unspecific", {"personal", "E1", "E2", "unspecific", "76", "76", "unspecific"}},
+      {"P", {"personal", "76", "76", "unspecific", "76", "76", "unspecific"}},
+      {"E1", {"76", "E1", "76", "76", "76", "76", "76"}},
+      {"none", {"76", "76", "76", "76", "76", "76", "76"}}};
+  for (const auto& [client, expected] : cases) {
     const TSYClientConnection connection =
-        unentitledConnection(clientWith("com.client", user(test.client)));
-    EXPECT_EQ(nameOf(TSYResolvePersona(connection, test.persona)), test.result)
-        << test.client << " " << test.persona.value_or("(null)");
+        unentitledConnection(clientWith("com.client", user(client)));
+    std::vector<std::string> results;
+    for (const auto& persona : personas) {
+      results.push_back(nameOf(TSYResolvePersona(connection, persona)));
+    }
+    EXPECT_EQ(results, expected) << client;
   }
-  EXPECT_EQ(device.countInLog("Cannot reconstitute a user identity from provided persona"), 2U);
-  EXPECT_EQ(device.countInLog("Persona unique string is not valid for this client"), 4U);
+  EXPECT_EQ(device.countInLog("Cannot reconstitute a user identity from provided persona"), 6U);
+  EXPECT_EQ(device.countInLog("Persona unique string is not valid for this client"), 6U);
 }
 
 TEST(TSYRequestResolvers, withSeveralUsersThePersonaStringIsIgnored) {
@@ -183,36 +169,32 @@ TEST(TSYRequestResolvers, concreteContainerIdentitiesOfRequests) {
 
 TEST(TSYRequestResolvers, tokensAreForSandboxedClientsOfEnterpriseContainers) {
   const ContainerDevice device(workPersonas());
-  const struct {
-    bool sandboxed;
-    std::string owner;
-    TSYContainerClass class_;
-    std::string extensionClass;  // empty for no token
-  } cases[] = {{true, "E1", 2, "com.veltra.sandbox.container"},
-               {true, "E1", 4, "com.veltra.sandbox.container"},
-               {true, "E1", 6, "com.veltra.sandbox.container"},
-               {true, "E1", 10, "com.veltra.sandbox.container"},
-               {true, "E1", 7, "com.veltra.sandbox.application-group"},
-               {true, "E1", 9, ""},
-               {true, "E1", 11, ""},
-               {true, "E1", 12, ""},
-               {true, "E1", 1, ""},
-               {true, "P", 2, ""},
-               {true, "unspecific", 7, ""},
-               {false, "E1", 2, ""}};
+  const std::string container = "com.veltra.sandbox.container";
+  const std::map<TSYContainerClass, std::string> extensions = {
+      {2, container},
+      {4, container},
+      {6, container},
+      {10, container},
+      {7, "com.veltra.sandbox.application-group"}};
+  const platform::Sandbox& sandbox = platform::Platform::current().sandbox;
   std::filesystem::create_directories(device.path("/container"));
-  for (const auto& test : cases) {
-    const TSYMetadata container(concreteContainerOf(user(test.owner), "com.app", test.class_),
-                                nullptr, TSYURL(device.path("/container")), std::nullopt);
-    const TSYClientIdentityRef client = clientWith("com.client", user("P"), {}, test.sandboxed);
-    const auto token = TSYIssueSandboxExtension(container, *client);
-    EXPECT_EQ(token.has_value(), !test.extensionClass.empty()) << test.owner << test.class_;
-    if (!token) continue;
-    EXPECT_TRUE(token->starts_with(test.extensionClass + ";")) << *token;
-    EXPECT_NE(token->find(";" + device.path("/container") + ";"), std::string::npos);
-    const platform::Sandbox& sandbox = platform::Platform::current().sandbox;
-    EXPECT_TRUE(sandbox.verifyExtension(*token, client->auditToken()));
-    EXPECT_FALSE(sandbox.verifyExtension(*token, platform::AuditToken{}));
+  for (const char* owner : {"E1", "P", "unspecific"}) {
+    for (TSYContainerClass class_ = 1; class_ < kTSYContainerClassMax; ++class_) {
+      const TSYMetadata metadata(concreteContainerOf(user(owner), "com.app", class_), nullptr,
+                                 TSYURL(device.path("/container")), std::nullopt);
+      const auto free = clientWith("com.client", user("P"));
+      EXPECT_FALSE(TSYIssueSandboxExtension(metadata, *free).has_value());
+      const auto client = clientWith("com.client", user("P"), {}, /*sandboxed=*/true);
+      const auto token = TSYIssueSandboxExtension(metadata, *client);
+      const auto extension = extensions.find(class_);
+      ASSERT_EQ(token.has_value(), owner == std::string("E1") && extension != extensions.end())
+          << owner << class_;
+      if (!token) continue;
+      EXPECT_TRUE(token->starts_with(extension->second + ";")) << *token;
+      EXPECT_NE(token->find(";" + device.path("/container") + ";"), std::string::npos);
+      EXPECT_TRUE(sandbox.verifyExtension(*token, client->auditToken()));
+      EXPECT_FALSE(sandbox.verifyExtension(*token, platform::AuditToken{}));
+    }
   }
 }
 
