@@ -124,9 +124,14 @@ TSYResult<TSYMetadataRef> TSYClientConnection::createContainer(const TSYContaine
   const auto created =
       _createTopLevelContainerDirectory(stagingURL, identity.containerClass(), owner);
   if (!created) {
-    return TSYFailure(TSYErrorCreate(TSYErrorStagingCreateFailed, created.error(), TSYLogIt::yes,
-                                     "Failed to create staging dir at {} : {}", stagingURL.path(),
-                                     created.error()));
+    TSYError failure = TSYErrorCreate(TSYErrorStagingCreateFailed, created.error(), TSYLogIt::yes,
+                                      "Failed to create staging dir at {} : {}", stagingURL.path(),
+                                      created.error());
+    // It may have been made, and only not be given its owner.
+    if (TSYFileManager::defaultManager().itemExistsAtURL(stagingURL)) {
+      (void)_moveItemAtURLToDeathRow(stagingURL, /*isDir=*/true, /*startDeletionThread=*/true);
+    }
+    return TSYFailure(std::move(failure));
   }
   // From here on the staging directory must not stay behind, also when an exception passes.
   TSYResult<TSYMetadata> built = TSYCatchingExceptions(

@@ -7,23 +7,53 @@
 #include "Daemon/TSYGlobalConfiguration.h"
 #include "Daemon/TSYLog.h"
 
-TSYResult<void> TSYClientConnection::_moveItemAtURLToDeathRow(const TSYURL& url, bool /*isDir*/,
-                                                              bool startDeletionThread) {
+namespace {
+
+// Death row is filled while it is emptied: a directory that was just made for an item may be
+// removed before the item is in it, or be found empty and not be so any more. Both pass when it is
+// tried anew, this often.
+constexpr int kAttempts = 16;
+
+// Moves the item into a new directory on death row: one of its own keeps items of the same name
+// apart.
+TSYResult<void> moveIntoOwnDirectory(const TSYURL& url) {
   TSYFileManager& files = TSYFileManager::defaultManager();
-  // A directory of its own keeps items of the same name apart.
   const auto directory = files.createTemporaryDirectoryInDirectoryURL(
       TSYGlobalConfiguration::sharedInstance().deathrowDirectory());
   if (!directory) {
     return TSYFailure(TSYErrorCreate(TSYErrorFileOperationFailed, directory.error(), TSYLogIt::yes,
                                      "Failed to create unique directory at: {}", url.path()));
   }
-  const TSYURL target = directory->appending(url.lastPathComponent());
-  const auto moved = files.renameItemAtURL(url, target);
+  return files.renameItemAtURL(url, directory->appending(url.lastPathComponent()));
+}
+
+TSYResult<void> removeWhole(const TSYURL& url) {
+  TSYFileManager& files = TSYFileManager::defaultManager();
+  auto removed = files.removeItemAtURL(url);
+  for (int attempt = 1; attempt < kAttempts; ++attempt) {
+    if (removed || !removed.error().isPosix(ENOTEMPTY)) break;
+    removed = files.removeItemAtURL(url);
+  }
+  return removed;
+}
+
+}  // namespace
+
+TSYResult<void> TSYClientConnection::_moveItemAtURLToDeathRow(const TSYURL& url, bool /*isDir*/,
+                                                              bool startDeletionThread) {
+  auto moved = moveIntoOwnDirectory(url);
+  for (int attempt = 1; attempt < kAttempts; ++attempt) {
+    if (moved || !moved.error().isPosix(ENOENT)) break;
+    // What is gone already counts as deleted.
+    if (TSYFileManager::defaultManager().itemDoesNotExistAtURL(url)) return {};
+    moved = moveIntoOwnDirectory(url);
+  }
+  if (!moved && moved.error().is(TSYErrorFileOperationFailed)) return moved;
   if (!moved) {
-    if (moved.error().isPosix(ENOENT)) return {};
-    return TSYFailure(TSYErrorCreate(TSYErrorFileOperationFailed, moved.error(), TSYLogIt::yes,
-                                     "Failed to move item at: {} to: {}", url.path(),
-                                     target.path()));
+    return TSYFailure(
+        TSYErrorCreate(TSYErrorFileOperationFailed, moved.error(), TSYLogIt::yes,
+                       "Failed to move item at: {} to: {}", url.path(),
+                       TSYGlobalConfiguration::sharedInstance().deathrowDirectory().path()));
   }
   if (startDeletionThread) deleteContainersOnDeathRowWithCompletion(nullptr);
   return {};
@@ -59,13 +89,13 @@ uint64_t TSYClientConnection::emptyDeathRow() {
 }
 
 TSYResult<void> TSYClientConnection::_removeItemOrMoveToTempAtURL(const TSYURL& url) {
-  TSYFileManager& files = TSYFileManager::defaultManager();
-  const auto removed = files.removeItemAtURL(url);
+  const auto removed = removeWhole(url);
   if (removed || removed.error().isPosix(ENOENT)) return {};
   TSYLogWrite(TSYLogLevelDebug, "Couldn't remove, so moving item to /tmp: {} : {}", url.path(),
               removed.error());
   const TSYURL temporary = TSYGlobalConfiguration::sharedInstance().temporaryDirectory();
-  const auto moved = files.renameItemAtURL(url, temporary.appending(url.lastPathComponent()));
+  const auto moved = TSYFileManager::defaultManager().renameItemAtURL(
+      url, temporary.appending(url.lastPathComponent()));
   if (moved) return {};
   return TSYFailure(TSYErrorCreate(TSYErrorMoveToTempFailed, moved.error(), TSYLogIt::yes,
                                    "Failed to move dir: {} to: {}", url.path(), temporary.path()));

@@ -55,9 +55,8 @@ void TSYContainerCache::ClassCache::store(TSYMetadataRef metadata) {
 }
 
 TSYContainerCache& TSYContainerCache::sharedInstance() {
-  static TSYContainerCache& cache =
-      *new TSYContainerCache(TSYUserIdentitySharedCache::sharedInstance(),
-                             TSYCodeSigningMapping::sharedInstance());
+  static TSYContainerCache& cache = *new TSYContainerCache(
+      TSYUserIdentitySharedCache::sharedInstance(), TSYCodeSigningMapping::sharedInstance());
   return cache;
 }
 
@@ -99,7 +98,8 @@ TSYResult<TSYContainerCache::ClassCache*> TSYContainerCache::_lock_getCache(
   if (const auto found = caches.find(key); found != caches.end()) return &found->second;
   TSYLogWrite(TSYLogLevelDebug, "Rebuilding container class cache: {}{}", key, mark(transient));
   TSY_SIGNPOST_BEGIN(RebuildingCache, this, contentClass);
-  auto scanned = _lock_scan(userIdentity, contentClass, transient, populateSandboxCache);
+  auto scanned =
+      _lock_scanWithOnePersonaList(userIdentity, contentClass, transient, populateSandboxCache);
   TSY_SIGNPOST_END(RebuildingCache, this, contentClass);
   if (!scanned) {
     return TSYFailure(TSYErrorCreate(TSYErrorCacheRebuildFailed, scanned.error(), TSYLogIt::yes,
@@ -108,6 +108,27 @@ TSYResult<TSYContainerCache::ClassCache*> TSYContainerCache::_lock_getCache(
                                      mark(transient)));
   }
   return &caches.emplace(key, std::move(*scanned)).first->second;
+}
+
+// The list may change between the moment a request is given its identity and this one, and again
+// during the scan, which resolves owners with the list. An entry made for a persona that is not
+// there would be incomplete, and nothing would drop it when the persona comes back: only those that
+// a list loses are invalidated.
+TSYResult<TSYContainerCache::ClassCache> TSYContainerCache::_lock_scanWithOnePersonaList(
+    const TSYUserIdentityRef& userIdentity, TSYContainerClass contentClass, bool transient,
+    bool populateSandboxCache) {
+  if (!userIdentity || !TSYIsPerUserClass(contentClass)) {
+    return _lock_scan(userIdentity, contentClass, transient, populateSandboxCache);
+  }
+  for (;;) {
+    const auto generation = userIdentityCache_.generationOfListKnowing(*userIdentity);
+    if (!generation) {
+      return TSYFailure(TSYPosixErrorCreate(platform::Errno{ENOENT}, "the persona of {} has gone",
+                                            cacheKey(userIdentity, contentClass)));
+    }
+    auto scanned = _lock_scan(userIdentity, contentClass, transient, populateSandboxCache);
+    if (userIdentityCache_.generationOfListKnowing(*userIdentity) == generation) return scanned;
+  }
 }
 
 TSYResult<TSYContainerCache::ClassCache> TSYContainerCache::_lock_scan(

@@ -107,6 +107,11 @@ class TSYContainerCache : public TSYUserIdentityCacheObserver {
   TSYResult<ClassCache*> _lock_getCache(const TSYUserIdentityRef& userIdentity,
                                         TSYContainerClass contentClass, bool transient,
                                         bool populateSandboxCache) REQUIRES(cacheLock_);
+  // Fails when the persona of `userIdentity` has gone.
+  TSYResult<ClassCache> _lock_scanWithOnePersonaList(const TSYUserIdentityRef& userIdentity,
+                                                     TSYContainerClass contentClass, bool transient,
+                                                     bool populateSandboxCache)
+      REQUIRES(cacheLock_);
   TSYResult<ClassCache> _lock_scan(const TSYUserIdentityRef& userIdentity,
                                    TSYContainerClass contentClass, bool transient,
                                    bool populateSandboxCache) REQUIRES(cacheLock_);

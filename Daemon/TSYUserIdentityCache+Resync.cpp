@@ -129,6 +129,7 @@ void TSYUserIdentityCache::flush() {
 std::vector<TSYUserIdentityRef> TSYUserIdentityCache::_lock_flush() {
   std::vector<TSYUserIdentityRef> invalidated = mirror_.enterpriseIdentities();
   cacheInvalid_ = true;
+  ++generation_;
   mirror_ = TSYPersonaMirror::withoutPersonas();
   return invalidated;
 }
@@ -137,6 +138,7 @@ void TSYUserIdentityCache::flushAndRepopulateWithUserIdentities(
     const std::vector<TSYUserIdentityRef>& identities) {
   const platform::MutexLock lock(lock_);
   mirror_ = TSYPersonaMirror::ofUserIdentities(identities);
+  ++generation_;
   cacheInvalid_ = false;
 }
 

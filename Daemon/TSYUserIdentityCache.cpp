@@ -197,6 +197,17 @@ bool TSYUserIdentityCache::isBundleIdentifierAssociatedWithUserIdentity(
                              });
 }
 
+std::optional<uint64_t> TSYUserIdentityCache::generationOfListKnowing(
+    const TSYUserIdentity& identity) {
+  const platform::MutexLock lock(lock_);
+  const TSYPersonaMirror& mirror = _lock_mirror();
+  if (identity.isEnterprise()) {
+    const TSYUserIdentityRef known = mirror.identityForUniqueString(identity.identifier());
+    if (known == nullptr || !known->isEqualToUserIdentity(identity)) return std::nullopt;
+  }
+  return generation_;
+}
+
 void TSYUserIdentityCache::forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
     const std::function<void(const TSYUserIdentityRef&)>& block) {
   IdentitySet identities;

@@ -72,6 +72,10 @@ class TSYUserIdentityCache {
   IdentitySet userIdentitiesForBundleIdentifier(const std::string& bundleIdentifier);
   bool isBundleIdentifierAssociatedWithUserIdentity(const std::string& bundleIdentifier,
                                                     const TSYUserIdentity& identity);
+  // The number of the persona list in force, another one after each flush; none when `identity` is
+  // of an enterprise persona that the list lacks. What was worked out between two equal answers was
+  // worked out with one list.
+  std::optional<uint64_t> generationOfListKnowing(const TSYUserIdentity& identity);
   // Runs `block` once per distinct identity, without a lock.
   void forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
       const std::function<void(const TSYUserIdentityRef&)>& block);
@@ -116,6 +120,7 @@ class TSYUserIdentityCache {
   platform::Mutex lock_;
   TSYPersonaMirror mirror_ GUARDED_BY(lock_);
   bool cacheInvalid_ GUARDED_BY(lock_) = true;
+  uint64_t generation_ GUARDED_BY(lock_) = 0;
   // The last one: its end waits for the flushes that are under way.
   platform::SerialQueue flushQueue_{"com.veltra.tessaryd.TSYUserIdentityCache.flushQueue"};
 };

@@ -136,10 +136,12 @@ const std::vector<Entry>* Accounts::refresh(Database<Entry>& database, const cha
   const auto bytes = isRegular ? readToEnd(file->get(), kLongestFile)
                                : Result<std::vector<uint8_t>>(failWith(EINVAL));
   if (!bytes) {
-    // What was good last stays. The state is remembered: one line in the log for each.
-    platformLog(LogLevel::error, "Accounts::refresh", "{} cannot be read: {}", path,
-                file ? bytes.error().message() : file.error().message());
-    if (status) database.stamp = Stamp(*status);
+    // What was good last stays, and reading is tried again: one line in the log for each state.
+    if (!status || database.unreadable != Stamp(*status)) {
+      platformLog(LogLevel::error, "Accounts::refresh", "{} cannot be read: {}", path,
+                  file ? bytes.error().message() : file.error().message());
+    }
+    if (status) database.unreadable = Stamp(*status);
     return &database.entries;
   }
   database.entries = parse<Entry>(asText(*bytes), path, fromLine);

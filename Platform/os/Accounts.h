@@ -61,6 +61,7 @@ class Accounts {
   template <typename Entry>
   struct Database {
     Stamp stamp;
+    Stamp unreadable;  // the state that is in the log as unreadable
     std::vector<Entry> entries;
   };
 

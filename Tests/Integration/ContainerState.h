@@ -21,6 +21,10 @@ struct Creation {
   tessary::Result<tessary::Container> lookUp(tessary::Client& client) const;
 };
 
+// A parent for devices that are started again and again: in memory, where fsync costs nothing, when
+// there is one with the attributes that containers need. Empty, for the usual place, otherwise.
+std::string quickParent();
+
 constexpr char kDeathRow[] = "/private/var/root/Library/Caches/com.veltra.tessaryd/Dead";
 
 // The names in a directory of the device, sorted; none when it is not there.

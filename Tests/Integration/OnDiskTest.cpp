@@ -128,7 +128,6 @@ const std::vector<std::string> kServiceNames = {"Library", "Library/Caches", "Li
 const std::vector<std::string> kGroupNames = {"Library", "Library/Caches", "Library/Preferences"};
 
 const std::vector<Row>& rows() {
-  const std::string global = "/private/var/containers/";
   static const std::vector<Row> table = {
       {1, "Bundle/Application", kInstallation, kInstallation, {}},
       {2,

@@ -55,7 +55,8 @@ TEST(ChannelTest, TakesOnlyTheReplyToItsRequest) {
     TestRoot root;
     const auto reply = callAnswered(root, hexBytes(answer));
     ASSERT_EQ(reply.has_value(), error == nullptr) << answer;
-    if (error != nullptr) EXPECT_THAT(reply.error().reason, testing::HasSubstr(error));
+    if (reply) continue;
+    EXPECT_THAT(reply.error().reason, testing::HasSubstr(error));
   }
 }
 
