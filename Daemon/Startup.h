@@ -1,6 +1,6 @@
-// The life of the daemon: entry, initialisation, end.
+// Initialisation of the daemon: its log, its queues, what a start of it does.
 #pragma once
 
-// Runs the daemon on the current platform until it is told to end (SIGTERM, SIGINT). Returns the
-// exit status of the process. On the main thread, before any other is started.
-int TSYRunDaemon();
+// Runs once, before any request is served, on the listener queue. What cannot be done without ends
+// the process; everything else is logged and passed over.
+void TSYInitialiseDaemon();

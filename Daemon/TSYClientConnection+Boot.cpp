@@ -1,6 +1,7 @@
 // What start-up runs on the daemon's own connection.
 
 #include "Daemon/TSYClientConnection.h"
+#include "Daemon/TSYContainerCache.h"
 #include "Daemon/TSYDaemonQueues.h"
 #include "Daemon/TSYFileManager.h"
 #include "Daemon/TSYGlobalConfiguration.h"
@@ -42,12 +43,100 @@ void TSYClientConnection::tessaryCleanupWithCompletion(std::function<void(uint64
       [&items](const TSYUserIdentityRef& identity) {
         if (identity) appendItemsInStagingOf(identity, items);
       });
-  TSYAsyncKeepingAlive(
-      backgroundQueue(), [this, items = std::move(items), completion = std::move(completion)] {
-        for (const TSYURL& item : items) {
-          // What cannot be moved stays for the next start.
-          (void)_moveItemAtURLToDeathRow(item, /*isDir=*/true, /*startDeletionThread=*/false);
+  TSYAsyncKeepingAlive(backgroundQueue(),
+                       [this, items = std::move(items), completion = std::move(completion)] {
+                         for (const TSYURL& item : items) {
+                           // What cannot be moved stays for the next start.
+                           (void)_moveItemAtURLToDeathRow(item, /*startDeletionThread=*/false);
+                         }
+                         deleteContainersOnDeathRowWithCompletion(completion);
+                       });
+}
+
+void TSYClientConnection::sentence(const TSYURL& url, std::string_view kind) {
+  const auto moved = _moveItemAtURLToDeathRow(url, /*startDeletionThread=*/false);
+  if (moved) return;
+  TSYLogWrite(TSYLogLevelError, "Failed to delete {} URL {} : {}", kind, url.path(), moved.error());
+}
+
+void TSYClientConnection::sentenceTransientContainers() {
+  TSYGlobalConfiguration& configuration = TSYGlobalConfiguration::sharedInstance();
+  sentence(configuration.transientDirectory(), "shared transient");
+  if (const auto legacy = configuration.legacyTransientBundleDirectory()) {
+    TSYLogWrite(TSYLogLevelNotice,
+                "Sentencing legacy transient bundle directory [{}] to final deletion",
+                legacy->path());
+    sentence(*legacy, "legacy shared transient bundle");
+  }
+  sentence(configuration.transientBundleDirectory(), "shared transient bundle");
+}
+
+void TSYClientConnection::queueOrphanCleanup(const TSYUserIdentityRef& userIdentity,
+                                             TSYContainerClass containerClass) {
+  const auto directory =
+      TSYGlobalConfiguration::sharedInstance().containerDirectoryURLForUserIdentity(
+          userIdentity, containerClass, /*transient=*/false);
+  std::optional<std::vector<TSYURL>> directories;
+  if (directory) {
+    if (auto items = TSYFileManager::defaultManager().urlsForItemsInDirectoryAtURL(*directory)) {
+      directories = std::move(*items);
+    }
+  }
+  backgroundQueue().async([this, containerClass, directories = std::move(directories)] {
+    _cleanupOrphanedDataForDirectories(directories, containerClass);
+  });
+}
+
+void TSYClientConnection::_cleanupOrphanedDataForDirectories(
+    const std::optional<std::vector<TSYURL>>& directories, TSYContainerClass containerClass) {
+  if (!directories) {
+    TSYLogWrite(TSYLogLevelError, "Failed to get items : {}", containerClass);
+    return;
+  }
+  TSYFileManager& files = TSYFileManager::defaultManager();
+  for (const TSYURL& url : *directories) {
+    if (files.itemDoesNotExistAtURL(url)) {
+      TSYSystemLogWrite(TSYChannel::unspecified, platform::LogLevel::standard,
+                        "Ignoring deleted container path during cleanup: [{}]", url.path());
+      continue;
+    }
+    if (TSYContainerCache::containerURLIsValidForContainerClass(url, containerClass)) {
+      // Only one that is known not to be there: a file that cannot be looked at is no reason.
+      if (!files.itemDoesNotExistAtURL(url.appending(kTSYMetadataFileName))) continue;
+      TSYLogWrite(TSYLogLevelError, "Deleting orphaned data missing a metadata file at: {}",
+                  url.path());
+    }
+    if (TSYGlobalConfiguration::sharedInstance().isInternalImage()) {
+      TSYLogWrite(TSYLogLevelError, "Orphaned data found; please file a problem report with this:");
+      files.printDirectoryStructureAtURL(url);
+      TSYLogWrite(TSYLogLevelError, "End of the orphaned data at {}", url.path());
+    }
+    (void)_moveItemAtURLToDeathRow(url, /*startDeletionThread=*/false);
+  }
+}
+
+void TSYClientConnection::rebootTessaryCleanupWithCompletion(std::function<void()> completion) {
+  sentenceTransientContainers();
+  userIdentityCache_.forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
+      [this](const TSYUserIdentityRef& identity) {
+        if (!identity) return;
+        TSYPerUserConfiguration& configuration =
+            TSYGlobalConfiguration::sharedInstance().getPerUserConfigurationForUserIdentity(
+                identity);
+        if (!configuration.existsUserBaseDirectory()) return;
+        if (const auto transient = configuration.transientDirectory()) {
+          sentence(*transient, "per-user transient");
         }
-        deleteContainersOnDeathRowWithCompletion(completion);
+        for (TSYContainerClass number = 1; number < kTSYContainerClassMax; ++number) {
+          if (TSYIsPerUserClass(number)) queueOrphanCleanup(identity, number);
+        }
       });
+  for (TSYContainerClass number = 1; number < kTSYContainerClassMax; ++number) {
+    if (TSYIsGlobalClass(number)) {
+      queueOrphanCleanup(TSYUserIdentityCache::defaultUserIdentity(), number);
+    }
+  }
+  TSYAsyncKeepingAlive(backgroundQueue(), [completion = std::move(completion)] {
+    if (completion) completion();
+  });
 }

@@ -32,6 +32,39 @@ constexpr char kContentProtectionClassKey[] = "com.veltra.Hatchery.ContentProtec
 constexpr mode_t kDirectoryMode = 0755;
 constexpr int kProtectionClassUnprotected = 0;
 
+// The staging directory of a container that is being built. Unless it is committed, what is in it
+// goes to death row, also when an exception passes.
+class Staging {
+ public:
+  Staging(TSYClientConnection& connection, TSYURL url)
+      : connection_(connection), url_(std::move(url)) {}
+  ~Staging() {
+    if (!over_ && TSYFileManager::defaultManager().itemExistsAtURL(url_)) (void)moveAway();
+  }
+  Staging(const Staging&) = delete;
+  Staging& operator=(const Staging&) = delete;
+
+  const TSYURL& url() const { return url_; }
+  void commit() { over_ = true; }
+  // The failure to return: the one given, unless what it left behind cannot be moved away.
+  TSYError abandon(TSYError failure) {
+    over_ = true;
+    const auto moved = moveAway();
+    if (moved) return failure;
+    return TSYErrorCreate(TSYErrorStagingRemoveFailed, moved.error(), TSYLogIt::yes,
+                          "Failed to remove staging dir: {}", url_.path());
+  }
+
+ private:
+  TSYResult<void> moveAway() {
+    return connection_._moveItemAtURLToDeathRow(url_, /*startDeletionThread=*/true);
+  }
+
+  TSYClientConnection& connection_;
+  const TSYURL url_;
+  bool over_ = false;
+};
+
 // The owner of what is inside a container.
 uid_t ownerOfContent(const TSYMetadata& metadata) {
   if (TSYIsSystemClass(metadata.containerClass())) return platform::kNobodyAccount;
@@ -51,9 +84,11 @@ TSYResult<TSYMetadataRef> TSYClientConnection::createOrLookupContainerWithContai
   const auto operation = [&] {
     return createOrLookup(identity, createIfNecessary, transient, useLocking);
   };
-  // On an internal build an exception ends the process, with a report, where it was thrown.
-  if (TSYGlobalConfiguration::sharedInstance().isInternalImage()) return operation();
-  return TSYCatchingExceptions(operation);
+  if (!TSYGlobalConfiguration::sharedInstance().isInternalImage()) {
+    return TSYCatchingExceptions(operation);
+  }
+  // On an internal build an exception ends the process, with its report, where it was thrown.
+  return [&]() noexcept { return operation(); }();
 }
 
 TSYResult<TSYMetadataRef> TSYClientConnection::createOrLookup(
@@ -101,7 +136,7 @@ TSYResult<TSYMetadataRef> TSYClientConnection::createOrLookup(
 
 TSYResult<void> TSYClientConnection::removeTransientContainer(const TSYMetadata& container) {
   const TSYURL url = container.url();
-  const auto moved = _moveItemAtURLToDeathRow(url, /*isDir=*/true, /*startDeletionThread=*/true);
+  const auto moved = _moveItemAtURLToDeathRow(url, /*startDeletionThread=*/true);
   if (!moved) {
     return TSYFailure(TSYErrorCreate(TSYErrorTransientRemoveFailed, moved.error(), TSYLogIt::yes,
                                      "Failed to remove transient container at {}", url.path()));
@@ -115,30 +150,30 @@ TSYResult<void> TSYClientConnection::removeTransientContainer(const TSYMetadata&
 TSYResult<TSYMetadataRef> TSYClientConnection::createContainer(const TSYContainerIdentity& identity,
                                                                bool transient) {
   const std::string name = UUID::random().string();
-  TSY_SIGNPOST_EVENT(CreatingContainer, identity.identifier().c_str(), identity.containerClass());
-  const std::optional<TSYURL> staging =
+  TSY_SIGNPOST_EVENT3(CreatingContainer, name.c_str(), identity.identifier().c_str(),
+                      identity.containerClass());
+  const std::optional<TSYURL> directory =
       TSYGlobalConfiguration::sharedInstance().stagingDirectoryURLForUserIdentity(
           identity.userIdentity(), identity.containerClass());
-  const TSYURL stagingURL = staging.value_or(TSYURL()).appending(name);
-  const uid_t owner = identity.userIdentity()->posixUIDForContainerClass(identity.containerClass());
-  const auto created =
-      _createTopLevelContainerDirectory(stagingURL, identity.containerClass(), owner);
-  if (!created) {
-    TSYError failure = TSYErrorCreate(TSYErrorStagingCreateFailed, created.error(), TSYLogIt::yes,
-                                      "Failed to create staging dir at {} : {}", stagingURL.path(),
-                                      created.error());
-    // It may have been made, and only not be given its owner.
-    if (TSYFileManager::defaultManager().itemExistsAtURL(stagingURL)) {
-      (void)_moveItemAtURLToDeathRow(stagingURL, /*isDir=*/true, /*startDeletionThread=*/true);
-    }
-    return TSYFailure(std::move(failure));
+  if (!directory) {
+    return TSYFailure(TSYErrorCreate(TSYErrorStagingCreateFailed, std::nullopt, TSYLogIt::yes,
+                                     "Failed to create staging dir at {} : {}", "(null)",
+                                     "the user has no home directory"));
   }
-  // From here on the staging directory must not stay behind, also when an exception passes.
-  TSYResult<TSYMetadata> built = TSYCatchingExceptions(
-      [&]() -> TSYResult<TSYMetadata> { return buildInStaging(identity, stagingURL); });
-  if (!built) return TSYFailure(cleanUpStaging(stagingURL, std::move(built.error())));
-  auto liveURL = moveIntoPlace(identity, transient, stagingURL);
-  if (!liveURL) return TSYFailure(cleanUpStaging(stagingURL, std::move(liveURL.error())));
+  Staging staging(*this, directory->appending(name));
+  const auto created = _createTopLevelContainerDirectory(
+      staging.url(), identity.containerClass(),
+      identity.userIdentity()->posixUIDForContainerClass(identity.containerClass()));
+  if (!created) {
+    return TSYFailure(TSYErrorCreate(TSYErrorStagingCreateFailed, created.error(), TSYLogIt::yes,
+                                     "Failed to create staging dir at {} : {}",
+                                     staging.url().path(), created.error()));
+  }
+  auto built = buildInStaging(identity, staging.url());
+  if (!built) return TSYFailure(staging.abandon(std::move(built.error())));
+  auto liveURL = moveIntoPlace(identity, transient, staging.url());
+  if (!liveURL) return TSYFailure(staging.abandon(std::move(liveURL.error())));
+  staging.commit();
   return enterIntoCache(std::move(*built), *liveURL, transient);
 }
 
@@ -174,7 +209,12 @@ TSYResult<TSYURL> TSYClientConnection::moveIntoPlace(const TSYContainerIdentity&
   const std::optional<TSYURL> directory =
       TSYGlobalConfiguration::sharedInstance().containerDirectoryURLForUserIdentity(
           identity.userIdentity(), identity.containerClass(), transient);
-  const TSYURL liveURL = directory.value_or(TSYURL()).appending(name);
+  if (!directory) {
+    return TSYFailure(TSYErrorCreate(TSYErrorStagingMoveFailed, std::nullopt, TSYLogIt::yes,
+                                     "Failed to move staging dir: {} to live dir: {}",
+                                     stagingURL.path(), "(null)"));
+  }
+  const TSYURL liveURL = directory->appending(name);
   const auto moved = TSYFileManager::defaultManager().moveItemAtURL(stagingURL, liveURL);
   if (!moved) {
     return TSYFailure(TSYErrorCreate(TSYErrorStagingMoveFailed, moved.error(), TSYLogIt::yes,
@@ -202,14 +242,6 @@ TSYResult<TSYMetadataRef> TSYClientConnection::enterIntoCache(TSYMetadata metada
                                      metadata.description(), liveURL.path(), transient));
   }
   return std::make_shared<const TSYMetadata>(std::move(metadata));
-}
-
-TSYError TSYClientConnection::cleanUpStaging(const TSYURL& stagingURL, TSYError failure) {
-  const auto moved =
-      _moveItemAtURLToDeathRow(stagingURL, /*isDir=*/true, /*startDeletionThread=*/true);
-  if (moved) return failure;
-  return TSYErrorCreate(TSYErrorStagingRemoveFailed, moved.error(), TSYLogIt::yes,
-                        "Failed to remove staging dir: {}", stagingURL.path());
 }
 
 TSYResult<void> TSYClientConnection::_createTopLevelContainerDirectory(

@@ -39,7 +39,7 @@ TSYResult<void> removeWhole(const TSYURL& url) {
 
 }  // namespace
 
-TSYResult<void> TSYClientConnection::_moveItemAtURLToDeathRow(const TSYURL& url, bool /*isDir*/,
+TSYResult<void> TSYClientConnection::_moveItemAtURLToDeathRow(const TSYURL& url,
                                                               bool startDeletionThread) {
   auto moved = moveIntoOwnDirectory(url);
   for (int attempt = 1; attempt < kAttempts; ++attempt) {

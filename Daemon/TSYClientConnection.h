@@ -75,8 +75,8 @@ class TSYClientConnection {
   // replaces it. With useLocking NO the caller holds the identifier locks.
   //
   // Codes: 38 no identity, 55 not allowed, 21 not there and not to be created, 5, 7, 8, 9, 6, 45,
-  // 40, and those of the cache, the metadata file, the identity and the access-control lists. A
-  // failure never leaves a half-built container at a live path.
+  // 40, and those of the cache (43, 46, 47), the metadata file, the identity and the access-control
+  // lists. A failure never leaves a half-built container at a live path.
   TSYResult<TSYMetadataRef> createOrLookupContainerWithContainerIdentity(
       const std::optional<TSYContainerIdentity>& identity, bool createIfNecessary, bool transient,
       bool useLocking);
@@ -90,7 +90,7 @@ class TSYClientConnection {
 
   // Takes an item out of sight: moves it into a new directory on death row. A missing item is
   // success. Code 41.
-  TSYResult<void> _moveItemAtURLToDeathRow(const TSYURL& url, bool isDir, bool startDeletionThread);
+  TSYResult<void> _moveItemAtURLToDeathRow(const TSYURL& url, bool startDeletionThread);
   // Empties death row on its queue and returns at once. The completion, which may be null, gets 1
   // or the code of the last item that resisted.
   void deleteContainersOnDeathRowWithCompletion(std::function<void(uint64_t)> completion);
@@ -101,6 +101,9 @@ class TSYClientConnection {
   // Run at every start: throws away what is left in the staging directories and empties death row,
   // in the background. The completion, which may be null, gets the code of the emptying.
   void tessaryCleanupWithCompletion(std::function<void(uint64_t)> completion);
+  // Run at the first start after a boot: throws away transient containers and, in the background,
+  // what lies in a class directory and is no container. Death row is not emptied.
+  void rebootTessaryCleanupWithCompletion(std::function<void()> completion);
 
  private:
   using IdentifierSet = std::set<std::string, std::less<>>;
@@ -121,13 +124,17 @@ class TSYClientConnection {
                                   const TSYURL& stagingURL);
   TSYResult<TSYMetadataRef> enterIntoCache(TSYMetadata metadata, const TSYURL& liveURL,
                                            bool transient);
-  // Puts what a failure left in staging on death row; the failure to return.
-  TSYError cleanUpStaging(const TSYURL& stagingURL, TSYError failure);
   TSYResult<void> _createTopLevelContainerDirectory(const TSYURL& url,
                                                     TSYContainerClass containerClass, uid_t owner);
   TSYResult<void> _createSubDirectories(const TSYURL& containerURL,
                                         const TSYMetadata& containerMetadata);
   int _dataProtectionClassForContainerMetadata(const TSYMetadata& metadata);
+
+  void sentence(const TSYURL& url, std::string_view kind);
+  void sentenceTransientContainers();
+  void queueOrphanCleanup(const TSYUserIdentityRef& userIdentity, TSYContainerClass containerClass);
+  void _cleanupOrphanedDataForDirectories(const std::optional<std::vector<TSYURL>>& directories,
+                                          TSYContainerClass containerClass);
 
   static uint64_t emptyDeathRow();
   static TSYResult<void> _removeItemOrMoveToTempAtURL(const TSYURL& url);

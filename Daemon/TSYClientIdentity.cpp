@@ -66,9 +66,8 @@ TSYClientIdentityRef TSYClientIdentity::clientIdentityWithRelayConnection(
   const auto userIdentity =
       TSYUserIdentitySharedCache::sharedInstance().userIdentityForCurrentContextWithUID(peer.uid(),
                                                                                         peer.gid());
-  const std::optional<std::string> identifier =
-      peer.task ? peer.task->signingIdentifier : std::nullopt;
-  const bool isInstaller = identifier == kInstallerIdentifier;
+  const auto identifier = _bundleIdentifierFromPeer(peer);
+  const bool isInstaller = identifier && *identifier == kInstallerIdentifier;
   if (isInstaller) {
     if (auto remembered = rememberedInstaller(peer.token)) return remembered;
   }
@@ -76,7 +75,7 @@ TSYClientIdentityRef TSYClientIdentity::clientIdentityWithRelayConnection(
   TSYClientIdentityRef identity;
   if (!identifier) {
     TSYLogWrite(TSYLogLevelError, "Failed to copy signing ID for pid {} : {}", peer.pid(),
-                "no record of the process");
+                identifier.error());
   } else if (userIdentity) {
     identity = std::make_shared<const TSYClientIdentity>(
         *identifier, peer.uid(), peer.gid(), peer.pid(), userIdentity, std::move(entitlements),
@@ -89,6 +88,18 @@ TSYClientIdentityRef TSYClientIdentity::clientIdentityWithRelayConnection(
         "clientIdentityWithRelayConnection:", identity ? identity->description() : "(null)");
   }
   return identity;
+}
+
+TSYResult<std::string> TSYClientIdentity::_bundleIdentifierFromPeer(
+    const platform::ipc::Peer& peer) {
+  if (!peer.task) {
+    return TSYFailure(TSYPosixErrorCreate(platform::Errno{ENOENT}, "no record of the process"));
+  }
+  if (!peer.task->signingIdentifier) {
+    return TSYFailure(
+        TSYPosixErrorCreate(platform::Errno{EINVAL}, "its record has no code-signing identifier"));
+  }
+  return *peer.task->signingIdentifier;
 }
 
 TSYClientIdentityRef TSYClientIdentity::privilegedClientIdentityWithUserIdentity(

@@ -30,6 +30,9 @@ class TSYClientIdentity {
   // without a user. The installer's, which asks most, is remembered by its audit token. Called
   // while the caller context of the request is set.
   static TSYClientIdentityRef clientIdentityWithRelayConnection(const platform::ipc::Peer& peer);
+  // The code-signing identifier of the process; a POSIX error when it has no record (ENOENT) or one
+  // without an identifier (EINVAL).
+  static TSYResult<std::string> _bundleIdentifierFromPeer(const platform::ipc::Peer& peer);
   // For the daemon's own work on behalf of a user.
   static TSYClientIdentityRef privilegedClientIdentityWithUserIdentity(
       TSYUserIdentityRef userIdentity);

@@ -21,7 +21,7 @@ uint64_t TSYHandleCreateOrLookup(TSYRelayEvent& event, TSYClientConnection& conn
   const auto found = connection.createOrLookupContainerWithContainerIdentity(
       std::move(*identity), event.request.boolean("CreateIfNecessary").value_or(false),
       event.request.boolean("Transient").value_or(false), /*useLocking=*/true);
-  if (!found) return found.error().code();
+  if (!found) return found.error().clientCode();
 
   const TSYMetadata& container = **found;
   event.reply.set("ReplyUUID", container.uuid());
@@ -41,7 +41,7 @@ uint64_t TSYHandleContainersOfClass(TSYRelayEvent& event, TSYClientConnection& c
   const auto containers =
       connection.containersWithClass(event.request.uint64("ContainerClass").value_or(0),
                                      event.request.boolean("Transient").value_or(false));
-  if (!containers) return containers.error().code();
+  if (!containers) return containers.error().clientCode();
   Value::Array identifiers;
   Value::Array uuids;
   Value::Array personas;
@@ -69,10 +69,10 @@ uint64_t TSYHandleSystemContainerPath(TSYRelayEvent& event, TSYClientConnection&
   if (!userIdentity) return userIdentity.error();
   auto identity = TSYContainerIdentity::containerIdentityWithUserIdentity(
       std::move(*userIdentity), *identifier, kTSYContainerClassSystemData);
-  if (!identity) return identity.error().code();
+  if (!identity) return identity.error().clientCode();
   const auto found = connection.createOrLookupContainerWithContainerIdentity(
       std::move(*identity), /*createIfNecessary=*/true, /*transient=*/false, /*useLocking=*/true);
-  if (!found) return found.error().code();
+  if (!found) return found.error().clientCode();
   event.reply.set("ReplyPath", (*found)->url().path());
   return TSYErrorSuccess;
 }

@@ -6,8 +6,8 @@
 #pragma once
 
 #include <cstdint>
+#include <list>
 #include <memory>
-#include <vector>
 
 #include "Daemon/TSYError.h"
 #include "Platform/base/Mutex.h"
@@ -30,13 +30,15 @@ class TSYCommandQueue {
   void insertCommand(std::shared_ptr<TSYCommand> command);
   // Fails with the command's error, or with code 77 when none is left.
   TSYResult<void> executeNextCommand();
-  // Executes until none is left. The first failure ends it; the commands behind stay queued.
+  // Executes until none is left. The first failure ends it; the commands behind stay queued. Not
+  // from a command of this queue, which would wait for itself.
   TSYResult<void> executeAllUntilExhausted();
 
  private:
   std::shared_ptr<TSYCommand> takeFirst();
+  TSYResult<void> execute(TSYCommand& command);
 
   platform::SerialQueue queue_{"com.veltra.tessaryd.TSYCommandQueue"};
   platform::Mutex monitor_;
-  std::vector<std::shared_ptr<TSYCommand>> commands_ GUARDED_BY(monitor_);
+  std::list<std::shared_ptr<TSYCommand>> commands_ GUARDED_BY(monitor_);
 };

@@ -13,7 +13,10 @@
 // One request on its way through a handler.
 struct TSYRelayEvent {
   const platform::ipc::Message& request;
-  platform::ipc::Message& reply;
+  platform::ipc::Message reply;
+  // The right to answer. A handler that replies later moves it out; while it is here, the
+  // dispatcher answers.
+  std::optional<platform::ipc::ReplyPort> replyPort;
 };
 
 // Returns a TSYErrorCode. Runs on the worker that took the request.
@@ -23,8 +26,8 @@ struct TSYCommandRow {
   uint64_t command;  // equals the row's index
   TSYCommandHandler handler;
   const char* entitlement;
-  // The dispatcher always sends the reply; if not, it sends one only on failure and on success the
-  // handler sends it himself.
+  // The dispatcher always sends the reply; if not, it sends one only on failure, and on success the
+  // handler has taken the reply port.
   bool repliesOnReturn;
   // The command runs even for a client without the entitlement, who then sees only what the
   // operation lets him see.

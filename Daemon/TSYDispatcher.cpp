@@ -89,8 +89,8 @@ uint64_t runHandler(const TSYCommandRow& row, TSYRelayEvent& event,
   const auto handled = TSYCatchingExceptions(
       [&]() -> TSYResult<uint64_t> { return row.handler(event, connection); });
   const auto completed = connection.complete();
-  if (!completed) return completed.error().code();
-  return handled ? *handled : handled.error().code();
+  if (!completed) return completed.error().clientCode();
+  return handled ? *handled : handled.error().clientCode();
 }
 
 uint64_t processCommand(uint64_t command, const platform::ipc::Peer& peer, TSYRelayEvent& event,
@@ -137,17 +137,16 @@ void TSYProcessRelayEvent(platform::ipc::Request request) {
   const platform::ipc::Peer& peer = request.connection.peer();
   const TSYUserIdentityCache::CallerContext context(peer.task ? peer.task->personaUniqueString
                                                               : std::nullopt);
-  Message reply;
-  TSYRelayEvent event{request.message, reply};
+  TSYRelayEvent event{request.message, Message(), std::move(request.reply)};
   TSYClientIdentityRef client;
   const uint64_t code = processCommand(command, peer, event, client);
 
   const std::string_view clientName =
       client ? std::string_view(client->bundleIdentifier()) : std::string_view("<unknown>");
-  TSY_SIGNPOST_END(RelayEventProcessing, &request, clientName.data());
+  TSY_SIGNPOST_END2(RelayEventProcessing, &request, command, clientName.data());
   TSYSystemLogWrite(TSYChannel::relay, LogLevel::standard, "command={}, client={}, error={}",
                     command, clientName, code);
-  if (!dispatcherReplies(command, code)) return;
-  reply.set("ReplyError", code);
-  std::move(*request.reply).send(reply);
+  if (!event.replyPort || !dispatcherReplies(command, code)) return;
+  event.reply.set("ReplyError", code);
+  std::move(*event.replyPort).send(event.reply);
 }

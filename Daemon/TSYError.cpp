@@ -53,6 +53,10 @@ const std::optional<std::string>& TSYError::localizedDescription() const {
   return details_->description;
 }
 
+uint64_t TSYError::clientCode() const {
+  return domain() == TSYErrorDomain ? code() : uint64_t{TSYErrorFileOperationFailed};
+}
+
 bool TSYError::isPosix(int errnoValue) const {
   return domain() == TSYPosixErrorDomain && code() == static_cast<uint64_t>(errnoValue);
 }

@@ -30,6 +30,8 @@ class TSYError {
 
   std::string_view domain() const;
   uint64_t code() const;
+  // The code as a client gets it: a POSIX error that nobody has named is a failed file operation.
+  uint64_t clientCode() const;
   bool isPosix(int errnoValue) const;
   bool is(TSYErrorCode code) const;
   // None when the error was built without a format.

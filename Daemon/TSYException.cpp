@@ -1,7 +1,20 @@
 #include "Daemon/TSYException.h"
 
-TSYError TSYErrorFromException(const std::exception& exception, std::source_location where) {
-  return TSYErrorCreateWithText(
-      TSYErrorException, std::nullopt, TSYLogIt::yes, where,
-      fmt::format("Got exception: {} : {}", typeid(exception).name(), exception.what()));
+#include <exception>
+
+#include "Daemon/TSYTypeName.h"
+
+TSYError TSYErrorFromCurrentException(std::source_location where) {
+  std::string name = "unknown";
+  std::string reason = "(no reason)";
+  try {
+    throw;
+  } catch (const std::exception& exception) {
+    name = TSYTypeName(typeid(exception));
+    reason = exception.what();
+  } catch (...) {
+    reason = "not a standard exception";
+  }
+  return TSYErrorCreateWithText(TSYErrorException, std::nullopt, TSYLogIt::yes, where,
+                                fmt::format("Got exception: {} : {}", name, reason));
 }

@@ -1,14 +1,13 @@
 // The boundary of an operation that is said to survive exceptions.
 #pragma once
 
-#include <exception>
-#include <typeinfo>
+#include <source_location>
 #include <utility>
 
 #include "Daemon/TSYError.h"
 
-// "name : reason" of the exception becomes a failure of code 40, logged.
-TSYError TSYErrorFromException(const std::exception& exception, std::source_location where);
+// "name : reason" of the exception that is being handled becomes a failure of code 40, logged.
+TSYError TSYErrorFromCurrentException(std::source_location where);
 
 // Runs `operation`, which returns a TSYResult; an exception that escapes it becomes code 40.
 template <typename Operation>
@@ -17,7 +16,7 @@ auto TSYCatchingExceptions(Operation&& operation,
     -> decltype(operation()) {
   try {
     return std::forward<Operation>(operation)();
-  } catch (const std::exception& exception) {
-    return TSYFailure(TSYErrorFromException(exception, where));
+  } catch (...) {
+    return TSYFailure(TSYErrorFromCurrentException(where));
   }
 }

@@ -23,7 +23,7 @@ uint64_t sizeByWalking(const TSYURL& url) {
                 size.error().value, size.error().message());
     return 0;
   }
-  TSY_SIGNPOST_EVENT(CalculatingDiskUsageNodes, &url, size->descendants);
+  TSY_SIGNPOST_EVENT3(CalculatingDiskUsageNodes, path.c_str(), size->descendants, size->bytes);
   TSYSystemLogWrite(TSYChannel::fs, platform::LogLevel::info,
                     "[{}]: descendants: {}, total size: {}, using fallback", path,
                     size->descendants, size->bytes);

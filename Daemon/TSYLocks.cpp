@@ -18,6 +18,7 @@
 namespace {
 
 using platform::MutexLock;
+using std::atomic_load;
 
 constexpr uint64_t kGlobalLockSignpost = 0xEEEEB0B5B2B2EEEE;
 
@@ -46,110 +47,102 @@ struct LockTable {
   }
 };
 
-LockTable& table() {
-  static LockTable& instance = *new LockTable();
-  return instance;
-}
+LockTable& gTSYLocks = *new LockTable();
 
 const char* purpose(bool writing) {
   return writing ? "writing" : "reading";
 }
 
 // Announces the lock to global ones and finds or makes the identifier's record.
-LockRecord& enterIdentifier(const std::string& identifier, bool writing) {
-  LockTable& locks = table();
-  const MutexLock lock(locks.mutex);
+LockRecord* enterIdentifier(const std::string& identifier, bool writing) {
+  const MutexLock lock(gTSYLocks.mutex);
   if (writing) {
-    while (locks.allReaderWriterState != 0) locks.identifierWriters.wait(locks.mutex);
-    ++locks.identifierWriterCount;
+    while (gTSYLocks.allReaderWriterState != 0) gTSYLocks.identifierWriters.wait(gTSYLocks.mutex);
+    ++gTSYLocks.identifierWriterCount;
   } else {
-    while (locks.allReaderWriterState == -1) locks.identifierReaders.wait(locks.mutex);
-    ++locks.identifierReaderCount;
+    while (gTSYLocks.allReaderWriterState == -1) gTSYLocks.identifierReaders.wait(gTSYLocks.mutex);
+    ++gTSYLocks.identifierReaderCount;
   }
-  std::unique_ptr<LockRecord>& record = locks.identifierToLockMap[identifier];
+  std::unique_ptr<LockRecord>& record = gTSYLocks.identifierToLockMap[identifier];
   if (record) {
     ++record->references;
   } else {
     record = std::make_unique<LockRecord>();
   }
-  return *record;
+  return record.get();
 }
 
-void waitForWriting(LockRecord& record, const std::string& identifier) {
+void waitForWriting(LockRecord* lockPtr, const std::string& identifier) {
   const size_t signpost = std::hash<std::string>{}(identifier);
   TSY_SIGNPOST_BEGIN(WaitingForWriteLockWithIdentifier, signpost, identifier.c_str());
-  record.lock.lock();
+  lockPtr->lock.lock();
   TSY_SIGNPOST_END(WaitingForWriteLockWithIdentifier, signpost, identifier.c_str());
   int32_t expected = 0;
-  TSY_INVARIANT(record.lockState.compare_exchange_strong(expected, -1));
+  TSY_INVARIANT(lockPtr->lockState.compare_exchange_strong(expected, -1));
   TSY_SIGNPOST_BEGIN(WriteLockWithIdentifier, signpost, identifier.c_str());
 }
 
-void waitForReading(LockRecord& record, const std::string& identifier) {
+void waitForReading(LockRecord* lockPtr, const std::string& identifier) {
   const size_t signpost = std::hash<std::string>{}(identifier);
   TSY_SIGNPOST_BEGIN(WaitingForReadLockWithIdentifier, signpost, identifier.c_str());
-  record.lock.lock_shared();
+  lockPtr->lock.lock_shared();
   TSY_SIGNPOST_END(WaitingForReadLockWithIdentifier, signpost, identifier.c_str());
-  TSY_INVARIANT(record.lockState.fetch_add(1) >= 0);
+  TSY_INVARIANT(lockPtr->lockState.fetch_add(1) >= 0);
   TSY_SIGNPOST_BEGIN(ReadLockWithIdentifier, signpost, identifier.c_str());
 }
 
 void takeOneLock(const std::string& identifier, bool writing) {
-  LockRecord& record = enterIdentifier(identifier, writing);
+  LockRecord* lockPtr = enterIdentifier(identifier, writing);
   TSYLogWrite(TSYLogLevelDebug, "Waiting to lock {} for {}", identifier, purpose(writing));
   if (writing) {
-    waitForWriting(record, identifier);
+    waitForWriting(lockPtr, identifier);
   } else {
-    waitForReading(record, identifier);
+    waitForReading(lockPtr, identifier);
   }
   TSYLogWrite(TSYLogLevelDebug, "Got lock on identifier {}", identifier);
 }
 
-void leaveReading(LockTable& locks, LockRecord& record, const std::string& identifier)
-    REQUIRES(locks.mutex) {
-  record.lockState.fetch_sub(1);
-  TSY_INVARIANT(locks.allReaderWriterState >= 0);
-  TSY_INVARIANT(locks.identifierReaderCount > 0);
-  --locks.identifierReaderCount;
+void leaveReading(LockRecord* lockPtr, const std::string& identifier) REQUIRES(gTSYLocks.mutex) {
+  lockPtr->lockState.fetch_sub(1);
+  TSY_INVARIANT(gTSYLocks.allReaderWriterState >= 0);
+  TSY_INVARIANT(gTSYLocks.identifierReaderCount > 0);
+  --gTSYLocks.identifierReaderCount;
   TSY_SIGNPOST_END(ReadLockWithIdentifier, std::hash<std::string>{}(identifier),
                    identifier.c_str());
-  if (locks.isIdle()) locks.idle.notifyOne();
-  record.lock.unlock_shared();
+  if (gTSYLocks.isIdle()) gTSYLocks.idle.notifyOne();
+  lockPtr->lock.unlock_shared();
 }
 
-void leaveWriting(LockTable& locks, LockRecord& record, const std::string& identifier)
-    REQUIRES(locks.mutex) {
-  record.lockState.store(0);
-  TSY_INVARIANT(locks.allReaderWriterState == 0);
-  TSY_INVARIANT(locks.identifierWriterCount > 0);
-  --locks.identifierWriterCount;
+void leaveWriting(LockRecord* lockPtr, const std::string& identifier) REQUIRES(gTSYLocks.mutex) {
+  lockPtr->lockState.store(0);
+  TSY_INVARIANT(gTSYLocks.allReaderWriterState == 0);
+  TSY_INVARIANT(gTSYLocks.identifierWriterCount > 0);
+  --gTSYLocks.identifierWriterCount;
   TSY_SIGNPOST_END(WriteLockWithIdentifier, std::hash<std::string>{}(identifier),
                    identifier.c_str());
-  if (locks.isIdle()) locks.idle.notifyOne();
-  if (locks.identifierWriterCount == 0 && locks.allReaderWriterState != -1) {
-    locks.globalReaders.notifyAll();
+  if (gTSYLocks.isIdle()) gTSYLocks.idle.notifyOne();
+  if (gTSYLocks.identifierWriterCount == 0 && gTSYLocks.allReaderWriterState != -1) {
+    gTSYLocks.globalReaders.notifyAll();
   }
-  record.lock.unlock();
+  lockPtr->lock.unlock();
 }
 
 void unlockOneLock(const std::string& identifier) {
-  LockTable& locks = table();
-  const MutexLock lock(locks.mutex);
-  const auto found = locks.identifierToLockMap.find(identifier);
-  TSY_INVARIANT(found != locks.identifierToLockMap.end());
-  LockRecord& record = *found->second;
-  const int32_t state = record.lockState.load();
-  TSY_INVARIANT(state != 0);
-  if (state > 0) {
-    leaveReading(locks, record, identifier);
+  const MutexLock lock(gTSYLocks.mutex);
+  const auto found = gTSYLocks.identifierToLockMap.find(identifier);
+  TSY_INVARIANT(found != gTSYLocks.identifierToLockMap.end());
+  LockRecord* lockPtr = found->second.get();
+  TSY_INVARIANT(atomic_load(&lockPtr->lockState) != 0);
+  if (atomic_load(&lockPtr->lockState) > 0) {
+    leaveReading(lockPtr, identifier);
   } else {
-    leaveWriting(locks, record, identifier);
+    leaveWriting(lockPtr, identifier);
   }
   TSYLogWrite(TSYLogLevelDebug, "Unlocked identifier {}", identifier);
-  if (--record.references == 0) {
+  if (--lockPtr->references == 0) {
     TSYLogWrite(TSYLogLevelDebug, "Destroying lock for identifier {}", identifier);
-    TSY_INVARIANT(record.lockState.load() == 0);
-    locks.identifierToLockMap.erase(found);
+    TSY_INVARIANT(atomic_load(&lockPtr->lockState) == 0);
+    gTSYLocks.identifierToLockMap.erase(found);
   }
 }
 
@@ -194,47 +187,44 @@ void TSYUnlockIdentifiers(const TSYIdentifiers& identifiers) {
 
 void TSYLockAllIdentifiersForReading() {
   TSYLogWrite(TSYLogLevelDebug, "Waiting to lock all identifiers for {}", "reading");
-  LockTable& locks = table();
-  const MutexLock lock(locks.mutex);
   TSY_SIGNPOST_BEGIN(WaitingForGlobalReadLock, kGlobalLockSignpost, 0);
-  while (locks.identifierWriterCount > 0 || locks.allReaderWriterState == -1) {
-    locks.globalReaders.wait(locks.mutex);
+  const MutexLock lock(gTSYLocks.mutex);
+  while (gTSYLocks.identifierWriterCount > 0 || gTSYLocks.allReaderWriterState == -1) {
+    gTSYLocks.globalReaders.wait(gTSYLocks.mutex);
   }
   TSY_SIGNPOST_END(WaitingForGlobalReadLock, kGlobalLockSignpost, 0);
-  ++locks.allReaderWriterState;
+  ++gTSYLocks.allReaderWriterState;
   TSY_SIGNPOST_BEGIN(GlobalReadLock, kGlobalLockSignpost, 0);
   TSYLogWrite(TSYLogLevelDebug, "Locked all identifiers for {}", "reading");
 }
 
 void TSYLockAllIdentifiersForWriting() {
   TSYLogWrite(TSYLogLevelDebug, "Waiting to lock all identifiers for {}", "writing");
-  LockTable& locks = table();
-  const MutexLock lock(locks.mutex);
   TSY_SIGNPOST_BEGIN(WaitingForGlobalWriteLock, kGlobalLockSignpost, 0);
-  while (!locks.isIdle()) locks.idle.wait(locks.mutex);
+  const MutexLock lock(gTSYLocks.mutex);
+  while (!gTSYLocks.isIdle()) gTSYLocks.idle.wait(gTSYLocks.mutex);
   TSY_SIGNPOST_END(WaitingForGlobalWriteLock, kGlobalLockSignpost, 0);
-  locks.allReaderWriterState = -1;
+  gTSYLocks.allReaderWriterState = -1;
   TSY_SIGNPOST_BEGIN(GlobalWriteLock, kGlobalLockSignpost, 0);
   TSYLogWrite(TSYLogLevelDebug, "Locked all identifiers for {}", "writing");
 }
 
 void TSYUnlockAllIdentifiers() {
-  LockTable& locks = table();
   {
-    const MutexLock lock(locks.mutex);
-    if (locks.allReaderWriterState == -1) {
-      locks.allReaderWriterState = 0;
+    const MutexLock lock(gTSYLocks.mutex);
+    if (gTSYLocks.allReaderWriterState == -1) {
+      gTSYLocks.allReaderWriterState = 0;
       TSY_SIGNPOST_END(GlobalWriteLock, kGlobalLockSignpost, 0);
-      locks.idle.notifyOne();
-      locks.globalReaders.notifyAll();
-      locks.identifierWriters.notifyAll();
-      locks.identifierReaders.notifyAll();
+      gTSYLocks.idle.notifyOne();
+      gTSYLocks.globalReaders.notifyAll();
+      gTSYLocks.identifierWriters.notifyAll();
+      gTSYLocks.identifierReaders.notifyAll();
     } else {
-      TSY_INVARIANT(locks.allReaderWriterState > 0);
-      --locks.allReaderWriterState;
+      TSY_INVARIANT(gTSYLocks.allReaderWriterState > 0);
+      --gTSYLocks.allReaderWriterState;
       TSY_SIGNPOST_END(GlobalReadLock, kGlobalLockSignpost, 0);
-      if (locks.allReaderWriterState == 0) locks.identifierWriters.notifyAll();
-      if (locks.isIdle()) locks.idle.notifyOne();
+      if (gTSYLocks.allReaderWriterState == 0) gTSYLocks.identifierWriters.notifyAll();
+      if (gTSYLocks.isIdle()) gTSYLocks.idle.notifyOne();
     }
   }
   TSYLogWrite(TSYLogLevelDebug, "Unlocked all identifiers");

@@ -18,6 +18,7 @@
 #include <memory>
 #include <new>
 
+#include "Daemon/TSYTypeName.h"
 #include "Platform/base/Mutex.h"
 
 namespace {
@@ -68,13 +69,6 @@ std::string onOneLine(std::string_view text) {
   return line;
 }
 
-std::string demangled(const char* name) {
-  int status = 0;
-  const std::unique_ptr<char, decltype(&std::free)> text(
-      abi::__cxa_demangle(name, nullptr, nullptr, &status), &std::free);
-  return status == 0 ? text.get() : name;
-}
-
 std::string callStack() {
   constexpr int kDeepest = 64;
   std::array<void*, kDeepest> frames{};
@@ -101,14 +95,15 @@ std::string uncaughtExceptionText() {
     text += "<" + thread + "> ";
   }
   if (const std::type_info* type = abi::__cxa_current_exception_type()) {
-    text += demangled(type->name()) + ": ";
+    text += TSYTypeName(*type) + ": ";
   }
   if (const std::exception_ptr exception = std::current_exception()) {
     try {
       std::rethrow_exception(exception);
     } catch (const std::exception& reason) {
       text += reason.what();
-    } catch (...) {  // An exception of an unknown type has no reason to tell.
+    } catch (...) {
+      text += "(no reason)";
     }
   }
   return text + "\nStack:\n" + callStack();

@@ -40,6 +40,16 @@ std::string bundleIdentifierFor(const std::string& identifier, TSYContainerClass
       .value_or(identifier);
 }
 
+// The class under a key. Code 20 (logged) outside 1 to 13.
+TSYResolved<TSYContainerClass> resolveClass(const Message& request, std::string_view key) {
+  const TSYContainerClass containerClass = request.uint64(key).value_or(0);
+  if (TSYIsContainerClass(containerClass)) return containerClass;
+  return std::unexpected(TSYErrorCreate(TSYErrorUnexpectedContainerType, std::nullopt,
+                                        TSYLogIt::yes, "Passed an unexpected container type: {}",
+                                        containerClass)
+                             .code());
+}
+
 // The sandbox extension class of a container class; null when there is none.
 const char* extensionClassFor(TSYContainerClass containerClass) {
   switch (containerClass) {
@@ -95,22 +105,16 @@ TSYResolved<TSYUserIdentityRef> TSYResolveUserIdentityForIdentifier(
 
 TSYResolved<TSYContainerIdentity> TSYResolveContainerIdentity(const Message& request,
                                                               const TSYClientConnection& connection,
-                                                              TSYIdentifierFallback fallback,
-                                                              std::string_view classKey) {
+                                                              TSYIdentifierFallback fallback) {
   const auto identifier = TSYResolveIdentifier(request, connection, fallback);
   if (!identifier) return std::unexpected(uint64_t{TSYErrorMissingIdentifier});
-  const TSYContainerClass containerClass = request.uint64(classKey).value_or(0);
-  if (!TSYIsContainerClass(containerClass)) {
-    return std::unexpected(TSYErrorCreate(TSYErrorUnexpectedContainerType, std::nullopt,
-                                          TSYLogIt::yes, "Passed an unexpected container type: {}",
-                                          containerClass)
-                               .code());
-  }
-  auto userIdentity = TSYResolveUserIdentityForIdentifier(connection, *identifier, containerClass);
+  const auto containerClass = resolveClass(request, kTSYRequestContainerClass);
+  if (!containerClass) return std::unexpected(containerClass.error());
+  auto userIdentity = TSYResolveUserIdentityForIdentifier(connection, *identifier, *containerClass);
   if (!userIdentity) return std::unexpected(userIdentity.error());
   auto identity = TSYContainerIdentity::containerIdentityWithUserIdentity(
-      std::move(*userIdentity), *identifier, containerClass);
-  if (!identity) return std::unexpected(identity.error().code());
+      std::move(*userIdentity), *identifier, *containerClass);
+  if (!identity) return std::unexpected(identity.error().clientCode());
   return std::move(*identity);
 }
 
@@ -142,15 +146,10 @@ TSYResolved<TSYConcreteContainerIdentity> TSYResolveConcreteContainerIdentity(
     const Message& request, const TSYClientConnection& connection, const TSYConcreteKeys& keys) {
   const auto identifier = stringUnder(request, keys.identifier);
   if (!identifier) return std::unexpected(uint64_t{TSYErrorMissingIdentifier});
-  const TSYContainerClass containerClass = request.uint64(keys.containerClass).value_or(0);
-  if (!TSYIsContainerClass(containerClass)) {
-    return std::unexpected(TSYErrorCreate(TSYErrorUnexpectedContainerType, std::nullopt,
-                                          TSYLogIt::yes, "Passed an unexpected container type: {}",
-                                          containerClass)
-                               .code());
-  }
+  const auto containerClass = resolveClass(request, keys.containerClass);
+  if (!containerClass) return std::unexpected(containerClass.error());
   TSYUserIdentityRef userIdentity = clientsUser(connection);
-  if (TSYUserIdentity::isUserIdentityRequiredForContainerClass(containerClass)) {
+  if (TSYUserIdentity::isUserIdentityRequiredForContainerClass(*containerClass)) {
     auto persona = TSYResolvePersona(connection, stringUnder(request, keys.persona));
     if (!persona) return std::unexpected(persona.error());
     userIdentity = std::move(*persona);
@@ -158,8 +157,8 @@ TSYResolved<TSYConcreteContainerIdentity> TSYResolveConcreteContainerIdentity(
   const platform::UUID* uuid = request.uuid(keys.uuid);
   auto identity = TSYConcreteContainerIdentity::containerIdentityWithUUID(
       uuid == nullptr ? std::nullopt : std::optional(*uuid), std::move(userIdentity), *identifier,
-      containerClass);
-  if (!identity) return std::unexpected(identity.error().code());
+      *containerClass);
+  if (!identity) return std::unexpected(identity.error().clientCode());
   return std::move(*identity);
 }
 

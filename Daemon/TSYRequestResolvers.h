@@ -36,9 +36,9 @@ TSYResolved<TSYUserIdentityRef> TSYResolveUserIdentityForIdentifier(
     TSYContainerClass containerClass);
 
 // Codes 18, 20, 76, and those of TSYContainerIdentity.
-TSYResolved<TSYContainerIdentity> TSYResolveContainerIdentity(
-    const platform::ipc::Message& request, const TSYClientConnection& connection,
-    TSYIdentifierFallback fallback, std::string_view classKey = kTSYRequestContainerClass);
+TSYResolved<TSYContainerIdentity> TSYResolveContainerIdentity(const platform::ipc::Message& request,
+                                                              const TSYClientConnection& connection,
+                                                              TSYIdentifierFallback fallback);
 
 // The identity of a persona. Code 76 for an unknown one, and for one that is not the client's own
 // when the client has a specific persona.

@@ -4,7 +4,7 @@
 #include <csignal>
 #include <cstdlib>
 
-#include "Daemon/Startup.h"
+#include "Daemon/Service.h"
 #include "Daemon/TSYLog.h"
 #include "Platform/os/Platform.h"
 

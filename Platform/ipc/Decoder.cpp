@@ -72,7 +72,7 @@ class Decoder {
   void scalar(Content&& content);
   template <typename Number>
   void number(Number number);
-  void negative(uint64_t number);
+  void negative(uint64_t value);
   void text(std::string_view text);
   void key(std::string_view key);
   void data(std::span<const uint8_t> bytes);

@@ -318,7 +318,9 @@ TEST(TSYClientConnection, whatGoesToDeathRowKeepsItsNameAndIsEmptiedLater) {
   std::filesystem::create_symlink(device.path("/victim"), device.path("/three"));
   for (const char* item : {"/one/same", "/two/same", "/three", "/missing"}) {
     EXPECT_TRUE(
-        connection._moveItemAtURLToDeathRow(TSYURL(device.path(item)), true, false).has_value())
+        connection
+            ._moveItemAtURLToDeathRow(TSYURL(device.path(item)), /*startDeletionThread=*/false)
+            .has_value())
         << item;
     EXPECT_FALSE(std::filesystem::exists(device.path(item)));
   }
@@ -332,7 +334,8 @@ TEST(TSYClientConnection, whatGoesToDeathRowKeepsItsNameAndIsEmptiedLater) {
   std::filesystem::remove_all(device.path(kCaches));
   device.write(kDeathRow, "in the way");
   EXPECT_EQ(emptyDeathRow(), 28U);
-  expectFailure(connection._moveItemAtURLToDeathRow(TSYURL(device.path("/victim")), true, false),
+  expectFailure(connection._moveItemAtURLToDeathRow(TSYURL(device.path("/victim")),
+                                                    /*startDeletionThread=*/false),
                 41, "Failed to create unique directory at: " + device.path("/victim"));
 }
 

@@ -114,7 +114,7 @@ TEST(TSYDispatcher, whatEntitlementsComeTo) {
   }
   EXPECT_EQ(device.countInLog("connection attempt from pid 4711 (com.client) is not entitled"),
             refusedClients);
-  EXPECT_EQ(device.countInLog("connection attempt from pid 4711 ((null)) is not entitled"), 2U);
+  EXPECT_EQ(device.countInLog("connection attempt from pid 4711 ((null)) is not entitled"), 3U);
   EXPECT_EQ(device.countInLog("No entitled containers to wipe"), 5U);
 }
 

@@ -41,6 +41,7 @@ constexpr uid_t kOther = 502;
 constexpr char kHome[] = "/private/var/mobile";
 constexpr char kOtherHome[] = "/private/var/users/other";
 constexpr char kMetadataFile[] = "/.com.veltra.tessary.metadata.plist";
+constexpr char kMemory[] = "/dev/shm";
 constexpr char kApplication[] = "com.example.app";
 constexpr char kOutside[] = "com.example.outside";
 constexpr uint64_t kDone = 1;
@@ -118,7 +119,8 @@ class Attack : public ::testing::Test {
     if (::geteuid() != 0) GTEST_SKIP() << "processes of several users are needed";
     mayMount_ = ::unshare(CLONE_NEWNS) == 0 &&
                 ::mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == 0;
-    device_.emplace();
+    // In memory, where a creation does not wait for the disk, there are more of them in a race.
+    device_.emplace(fs::is_directory(kMemory) ? kMemory : "");
     ASSERT_EQ(runToEnd({Device::program("tessary-platform"), "--root", device_->root(), "init",
                         "--user", "other:502"})
                   .exitStatus,
@@ -351,8 +353,9 @@ class AttackInPlace : public Attack, public ::testing::WithParamInterface<Place>
     const Answers answers = askAll(client);
     if (obstacle == Obstacle::mount) return;  // an empty tree is as good as any
     const Place& place = GetParam();
-    // What is at the name of a known container's metadata file is not looked at again.
-    if (!isMetadata()) EXPECT_EQ(answers.existing == kDone, place.existing) << answers.existing;
+    // Of one container: its identifier may stand for another one of an earlier case.
+    const bool isTree = !isMetadata() && place.path != kContainer;
+    if (isTree) EXPECT_EQ(answers.existing == kDone, place.existing) << answers.existing;
     EXPECT_EQ(answers.created == kDone, place.created) << answers.created;
     EXPECT_EQ(answers.transient == kDone, place.transient) << answers.transient;
   }
@@ -439,20 +442,19 @@ TEST_F(Attack, ALayoutPathThroughALinkIsNoHome) {
 // --- Races --------------------------------------------------------------------------------------
 
 constexpr std::chrono::milliseconds kRaceLength{1500};
-constexpr int kPauses = 4096;
+constexpr unsigned kLengths = 16384;  // a period of the generator, too
 
 void exchange(int directory, const char* first, const char* second) {
   ::renameat2(directory, first, directory, second, RENAME_EXCHANGE);
 }
 
-// Swaps a directory for a link and back, with pauses of all lengths.
+// Swaps a directory for a link and back, each for times of all lengths.
 [[noreturn]] void raceForDirectory(const std::string& directory, std::atomic<uint64_t>& rounds) {
   const std::string link = directory + ".swap";
-  for (unsigned pause = 0;; pause = (pause * 5 + 3) % kPauses) {
+  for (unsigned length = 0;;) {
     exchange(AT_FDCWD, directory.c_str(), link.c_str());
-    for (unsigned i = 0; i < pause; ++i) ++rounds;
-    exchange(AT_FDCWD, directory.c_str(), link.c_str());
-    ::usleep(pause / 8);
+    length = (length * 5 + 3) % kLengths;
+    for (unsigned i = 0; i < length; ++i) ++rounds;
   }
 }
 
@@ -460,7 +462,12 @@ void exchange(int directory, const char* first, const char* second) {
 // descriptor leads to the container when it is on death row as well.
 [[noreturn]] void raceInContainers(const std::string& home, const std::string& target,
                                    std::atomic<uint64_t>& rounds) {
-  constexpr int kRounds = 400;
+  constexpr int kRounds = 100;
+  constexpr int kPairs = 32;
+  std::vector<std::pair<std::string, std::string>> pairs;
+  for (int i = 0; i < kPairs; ++i) {
+    pairs.emplace_back(fmt::format("d{}", i), fmt::format("l{}", i));
+  }
   const int outside = ::open(home.c_str(), O_PATH | O_DIRECTORY);
   for (;;) {
     std::error_code ignored;
@@ -468,13 +475,16 @@ void exchange(int directory, const char* first, const char* second) {
          fs::directory_iterator(home + "/Containers/Temp/Data/Application", ignored)) {
       const FileDescriptor container(::open(item.path().c_str(), O_RDONLY | O_DIRECTORY));
       if (!container.valid()) continue;
-      (void)::symlinkat(target.c_str(), container.get(), "swap");
+      for (const auto& [directory, link] : pairs) {
+        (void)::mkdirat(container.get(), directory.c_str(), 0755);
+        (void)::symlinkat(target.c_str(), container.get(), link.c_str());
+      }
       for (int i = 0; i < kRounds; ++i, ++rounds) {
-        exchange(container.get(), "Library", "swap");
-        ::renameat(container.get(), "swap/Caches", outside, "caught");
-        exchange(container.get(), "Library", "swap");
+        for (const auto& [directory, link] : pairs) {
+          exchange(container.get(), directory.c_str(), link.c_str());
+        }
+        ::renameat(container.get(), "Library/Caches", outside, "caught");
         ::renameat(outside, "caught", container.get(), "Library/Caches");
-        (void)::mkdirat(container.get(), "Library/Caches/deep", 0755);
       }
     }
   }
@@ -483,8 +493,12 @@ void exchange(int directory, const char* first, const char* second) {
 class AttackDuringRequests : public Attack, public ::testing::WithParamInterface<const char*> {
  protected:
   pid_t startRacer() {
-    if (isInContainers())
-      return forkAsMobile([&] { raceInContainers(home(), otherHome() + "/Library", *rounds_); });
+    if (isInContainers()) {
+      // Relative, and right on death row: an absolute link would lead through other mounts.
+      const fs::path victim = otherHome() + "/Library";
+      const fs::path link = victim.lexically_relative(device_->path(kDeathRow) + "/temp/container");
+      return forkAsMobile([&] { raceInContainers(home(), link, *rounds_); });
+    }
     const std::string directory = home(GetParam());
     fs::create_symlink(otherHome() + "/" + GetParam(), directory + ".swap");
     return forkAsMobile([&] { raceForDirectory(directory, *rounds_); });
@@ -545,7 +559,7 @@ TEST_P(AttackDuringRequests, LeadsNowhere) {
     expectService();
     EXPECT_TRUE(deathRowEmpties());
   }
-  EXPECT_GT(rounds_->load(), 1000U);
+  EXPECT_GT(rounds_->load(), 100U);
   EXPECT_EQ(victim_->changes(), "");
   fmt::print("{:<36} {} of {} creations done\n", GetParam(), done, requests);
   if (HasFailure()) fmt::print("{}\n", device_->systemLog().substr(0, 4000));

@@ -76,7 +76,7 @@ Device::Device(const std::string& parent) {
   root_ = std::filesystem::canonical(pattern).string();
   const Finished prepared = runToEnd({program("tessary-platform"), "--root", root_, "init"});
   EXPECT_EQ(prepared.exitStatus, 0) << prepared.errors;
-  files_ = std::move(*FileSystem::open(root_, platform::Privilege::root));
+  reopenRoot();
 }
 
 Device::~Device() {
@@ -109,6 +109,10 @@ void Device::kill() {
   ::kill(daemon_, SIGKILL);
   (void)waitForExit(daemon_);
   daemon_ = -1;
+}
+
+void Device::reopenRoot() {
+  files_ = std::move(*FileSystem::open(root_, platform::Privilege::root));
 }
 
 std::string Device::systemLog() const {

@@ -57,6 +57,10 @@ class Device {
   int stop();
   // Ends it with SIGKILL.
   void kill();
+  // Lets go of the root, so that the file system that it is on can be unmounted, and takes hold of
+  // it again. Between the two nothing but kill() may be called.
+  void releaseRoot() { files_.reset(); }
+  void reopenRoot();
   bool isRunning() const { return daemon_ > 0; }
   pid_t daemonPid() const { return daemon_; }
   // What the daemon wrote to standard error, and its own log.

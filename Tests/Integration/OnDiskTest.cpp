@@ -115,71 +115,61 @@ class OnDisk : public ::testing::Test {
   std::optional<Device> device_;
 };
 
-struct Row {
-  ContainerClass containerClass;
+constexpr char kServiceNames[] = "Library Library/Caches Library/Preferences tmp";
+constexpr char kGroupNames[] = "Library Library/Caches Library/Preferences";
+
+// Mobile stands for the user whose container it is.
+constexpr struct Row {
   const char* directory;  // of the class
-  uid_t owner;            // 501 for the user whose container it is
+  uid_t owner;
   uid_t contentOwner;
-  std::vector<std::string> subdirectories;
+  const char* subdirectories;
+} kRows[] = {
+    {"Bundle/Application", kInstallation, kInstallation, ""},
+    {"Data/Application", kMobile, kMobile,
+     "Documents Library Library/Caches Library/Preferences SystemData tmp"},
+    {"Bundle/ModulinePlugin", kInstallation, kInstallation, ""},
+    {"Data/ModulinePlugin", kMobile, kMobile,
+     "Library Library/Caches Library/Preferences SystemData tmp"},
+    {"Bundle/VPNPlugin", kInstallation, kInstallation, ""},
+    {"Data/VPNPlugin", kMobile, kMobile, kServiceNames},
+    {"Shared/AppGroup", kMobile, kMobile, kGroupNames},
+    {"Bundle/Framework", kInstallation, kInstallation, ""},
+    {"Data/RelayService", kMobile, kMobile, kServiceNames},
+    {"Data/InternalDaemon", kMobile, kMobile, kServiceNames},
+    {"Data/TempDir", kMobile, kMobile, kServiceNames},
+    {"Data/System", kRoot, kNobody, kServiceNames},
+    {"Shared/SystemGroup", kRoot, kNobody, kGroupNames},
 };
-
-const std::vector<std::string> kServiceNames = {"Library", "Library/Caches", "Library/Preferences",
-                                                "tmp"};
-const std::vector<std::string> kGroupNames = {"Library", "Library/Caches", "Library/Preferences"};
-
-const std::vector<Row>& rows() {
-  static const std::vector<Row> table = {
-      {1, "Bundle/Application", kInstallation, kInstallation, {}},
-      {2,
-       "Data/Application",
-       kMobile,
-       kMobile,
-       {"Documents", "Library", "Library/Caches", "Library/Preferences", "SystemData", "tmp"}},
-      {3, "Bundle/ModulinePlugin", kInstallation, kInstallation, {}},
-      {4,
-       "Data/ModulinePlugin",
-       kMobile,
-       kMobile,
-       {"Library", "Library/Caches", "Library/Preferences", "SystemData", "tmp"}},
-      {5, "Bundle/VPNPlugin", kInstallation, kInstallation, {}},
-      {6, "Data/VPNPlugin", kMobile, kMobile, kServiceNames},
-      {7, "Shared/AppGroup", kMobile, kMobile, kGroupNames},
-      {8, "Bundle/Framework", kInstallation, kInstallation, {}},
-      {9, "Data/RelayService", kMobile, kMobile, kServiceNames},
-      {10, "Data/InternalDaemon", kMobile, kMobile, kServiceNames},
-      {11, "Data/TempDir", kMobile, kMobile, kServiceNames},
-      {12, "Data/System", kRoot, kNobody, kServiceNames},
-      {13, "Shared/SystemGroup", kRoot, kNobody, kGroupNames},
-  };
-  return table;
-}
 
 TEST_F(OnDisk, EachClassHasItsPlaceOwnerModeAndSubdirectories) {
   device_->start();
   Caller alice = privilegedCaller();
   alice.uid = kAlice;
-  for (const Row& row : rows()) {
+  for (ContainerClass containerClass = 1; containerClass <= std::size(kRows); ++containerClass) {
+    const Row& row = kRows[containerClass - 1];
     const bool isPerUser = row.owner == kMobile;
-    const bool isSystem = row.containerClass >= 12;
+    const bool isSystem = containerClass >= 12;
     for (const Caller& caller : {privilegedCaller(), alice}) {
       if (caller.uid == kAlice && !isPerUser) continue;
-      const bool isAlice = caller.uid == kAlice;
       const auto user = [&](uid_t owner) { return isPerUser ? caller.uid : owner; };
-      const Answer made = device_->create(caller, "com.example.new", row.containerClass);
-      ASSERT_EQ(made.code, kDone) << row.containerClass << ": " << made.errors;
-      SCOPED_TRACE(made.text("path"));
-      const std::string home = isAlice ? "/private/var/users/alice" : "/private/var/mobile";
+      const Answer made = device_->create(caller, "com.example.new", containerClass);
+      ASSERT_EQ(made.code, kDone) << containerClass << ": " << made.errors;
+      const std::string container = made.text("path");
+      SCOPED_TRACE(container);
+      const std::string home =
+          caller.uid == kAlice ? "/private/var/users/alice" : "/private/var/mobile";
       const std::string directory =
           path((isPerUser ? home + "/Containers/" : "/private/var/containers/") + row.directory);
-      const std::string container = made.text("path");
       EXPECT_EQ(container, directory + "/" + nameOf(container));
       EXPECT_TRUE(platform::UUID::parse(nameOf(container)));
       EXPECT_NE(nameOf(container), made.text("uuid"));
       EXPECT_EQ(stateOf(directory), state(user(row.owner), "0755"));
       EXPECT_EQ(stateOf(container), state(user(row.owner), isSystem ? "0775" : "0755"));
       EXPECT_EQ(stateOf(container + kMetadataName), state(kRoot, "0644", 4));
-      EXPECT_EQ(directoriesIn(container), row.subdirectories);
-      for (const std::string& name : row.subdirectories) {
+      const auto subdirectories = directoriesIn(container);
+      EXPECT_EQ(fmt::format("{}", fmt::join(subdirectories, " ")), row.subdirectories);
+      for (const std::string& name : subdirectories) {
         EXPECT_EQ(stateOf(container + "/" + name),
                   state(user(row.contentOwner), isSystem ? "0070" : "0755"))
             << name;
@@ -238,7 +228,7 @@ TEST_F(OnDisk, WellKnownContainersHaveTheirNamesForDirectories) {
   for (const auto& [identifier, containerClass, place] : kCases) {
     const Answer found = device_->lookup(installer, identifier, containerClass);
     EXPECT_EQ(found.code, kDone) << identifier << containerClass << found.errors;
-    if (*place != '\0') EXPECT_EQ(found.text("path"), path(place));
+    EXPECT_TRUE(*place == '\0' || found.text("path") == path(place)) << found.text("path");
   }
 }
 
@@ -485,12 +475,12 @@ TEST_F(OnDisk, TheDaemonEndsWhileIdleClientsAreConnected) {
   std::vector<tessary::Client> clients;
   for (int i = 0; i < 5; ++i) {
     clients.push_back(device_->connect(privilegedCaller()));
-    if (i % 2 == 0) EXPECT_TRUE(clients.back().personaList());
+    EXPECT_TRUE(i % 2 == 0 || clients.back().personaList());
   }
   const auto started = std::chrono::steady_clock::now();
   EXPECT_EQ(device_->stop(), 0);
   EXPECT_LT(std::chrono::steady_clock::now() - started, std::chrono::seconds(30));
-  EXPECT_FALSE(clients.front().personaList());
+  EXPECT_FALSE(clients.back().personaList());
 }
 
 TEST_F(OnDisk, TheRootMayLieDeep) {

@@ -10,7 +10,9 @@
 #include <algorithm>
 #include <filesystem>
 #include <fstream>
+#include <iterator>
 #include <limits>
+#include <sstream>
 #include <vector>
 
 #include "Platform/ipc/Codec.h"
@@ -22,7 +24,6 @@
 
 using platform::Value;
 using platform::ipc::Message;
-using Arguments = std::vector<std::string>;
 using Array = Value::Array;
 using Dictionary = Value::Dictionary;
 
@@ -42,6 +43,21 @@ constexpr uint64_t kCommandCount = 33;
 constexpr uid_t kMobile = 501;
 constexpr uint64_t kHuge = std::numeric_limits<uint64_t>::max();
 
+std::vector<std::string> words(const std::string& line) {
+  std::istringstream stream(line);
+  return {std::istream_iterator<std::string>(stream), {}};
+}
+
+Caller named(const std::string& identifier) {
+  Caller caller;
+  caller.identifier = identifier;
+  return caller;
+}
+
+Caller lookingUp(Value lists) {
+  return Caller().with("lookup", std::move(lists));
+}
+
 class Rights : public ::testing::Test {
  protected:
   void SetUp() override {
@@ -52,15 +68,13 @@ class Rights : public ::testing::Test {
   struct Case {
     const char* who;
     Caller caller;
-    Arguments arguments;
+    std::string question;  // the words of a command line of tessaryctl
     uint64_t code;
   };
   void check(const std::vector<Case>& cases) const {
     for (const Case& one : cases) {
-      const Answer answer = device_->ask(one.caller, one.arguments);
-      EXPECT_EQ(answer.code, one.code)
-          << one.who << ": " << fmt::format("{}", fmt::join(one.arguments, " ")) << "\n"
-          << answer.errors;
+      const Answer answer = device_->ask(one.caller, words(one.question));
+      EXPECT_EQ(answer.code, one.code) << one.who << ": " << one.question << "\n" << answer.errors;
     }
   }
 
@@ -80,16 +94,6 @@ class Rights : public ::testing::Test {
   std::optional<Device> device_;
 };
 
-Caller named(const std::string& identifier) {
-  Caller caller;
-  caller.identifier = identifier;
-  return caller;
-}
-
-Caller lookingUp(Value lists) {
-  return Caller().with("lookup", std::move(lists));
-}
-
 TEST_F(Rights, OfTheCallerOverContainers) {
   device_->start();
   const Caller installer = privilegedCaller();
@@ -101,135 +105,99 @@ TEST_F(Rights, OfTheCallerOverContainers) {
   ASSERT_EQ(device_->create(installer, "com.veltra.exampled", 12).code, kDone);
 
   const Caller plain;
-  const auto other = [](const char* containerClass) {
-    return Arguments{"lookup", "--class", containerClass, "com.example.other"};
-  };
-  const auto create = [](const char* containerClass, const char* identifier) {
-    return Arguments{"create", "--class", containerClass, identifier};
-  };
+  const std::string other1 = "lookup --class 1 com.example.other";
+  const std::string other2 = "lookup --class 2 com.example.other";
+  const std::string other12 = "lookup --class 12 com.example.other";
+  const std::string create = "create --class ";
+  const std::string otherPath = "system-path com.example.other";
+  const std::string wellknownPath = "system-path com.veltra.exampled";
   const Value otherOnly = Array{"com.example.other"};
+  const auto list = [](const char* key, Value names) {
+    return lookingUp(Dictionary{{key, std::move(names)}});
+  };
+  const auto otherIds = [](Value value) { return Caller().with("otherIdLookup", value); };
+  const Caller widget = named("com.veltra.examplewidget");
+  const Caller seeker = named("com.veltra.seekerd");
+  const Caller shelf = named("com.veltra.shelfd");
+  const Caller hatchery = named("com.veltra.hatcheryd");
   Caller unprefixed;
   unprefixed.entitlements.emplace("allowed", true);
   check({
-      {"own", plain, {"create", "--class", "2"}, kDone},
-      {"own, by name", plain, create("2", "com.example.app"), kDone},
-      {"own bundle", plain, {"create", "--class", "1"}, kDone},
-      {"own group", plain, {"create", "--class", "13"}, kDone},
-      {"another's", plain, other("2"), kRefused},
-      {"another's bundle", plain, other("1"), kRefused},
-      {"another's group", plain, other("7"), kRefused},
-      {"another's, to be made", plain, create("2", "com.example.new"), kRefused},
-      {"by case", plain, create("2", "com.example.App"), kRefused},
+      {"own", plain, create + "2", kDone},
+      {"own, by name", plain, create + "2 com.example.app", kDone},
+      {"own bundle", plain, create + "1", kDone},
+      {"own group", plain, create + "13", kDone},
+      {"another's", plain, other2, kRefused},
+      {"another's bundle", plain, other1, kRefused},
+      {"another's group", plain, "lookup --class 7 com.example.other", kRefused},
+      {"another's, to be made", plain, create + "2 com.example.new", kRefused},
+      {"by case", plain, create + "2 com.example.App", kRefused},
 
-      {"lookup", lookingUp(Dictionary{{"appData", otherOnly}}), other("2"), kDone},
-      {"another class's list", lookingUp(Dictionary{{"pluginData", otherOnly}}), other("2"),
-       kRefused},
-      {"a class's list", lookingUp(Dictionary{{"appData", otherOnly}}), other("4"), kRefused},
-      {"a class's number", lookingUp(Dictionary{{"2", otherOnly}}), other("2"), kRefused},
-      {"no list", lookingUp(Dictionary{{"appData", "com.example.other"}}), other("2"), kRefused},
-      {"a dictionary as list",
-       lookingUp(Dictionary{{"appData", Dictionary{{"com.example.other", true}}}}), other("2"),
-       kRefused},
-      {"what is no string", lookingUp(Dictionary{{"appData", Array{1, true, otherOnly}}}),
-       other("2"), kRefused},
-      {"strings among others",
-       lookingUp(Dictionary{{"appData", Array{1, Array{}, "com.example.other"}}}), other("2"),
-       kDone},
-      {"no dictionary", lookingUp(Array{"appData", "com.example.other"}), other("2"), kRefused},
+      {"lookup", list("appData", otherOnly), other2, kDone},
+      {"another class's list", list("pluginData", otherOnly), other2, kRefused},
+      {"a class's number", list("2", otherOnly), other2, kRefused},
+      {"no list", list("appData", "com.example.other"), other2, kRefused},
+      {"a dictionary", list("appData", Dictionary{{"com.example.other", true}}), other2, kRefused},
+      {"no strings", list("appData", Array{1, true, otherOnly}), other2, kRefused},
+      {"strings too", list("appData", Array{1, "com.example.other"}), other2, kDone},
+      {"no dictionary", lookingUp(Array{"appData", "com.example.other"}), other2, kRefused},
 
-      {"otherIdLookup", Caller().with("otherIdLookup"), other("2"), kDone},
-      {"otherIdLookup", Caller().with("otherIdLookup"), create("7", "com.example.new"), kDone},
-      {"number 1", Caller().with("otherIdLookup", 1), other("2"), kDone},
-      {"number 0", Caller().with("otherIdLookup", 0), other("2"), kRefused},
-      {"false", Caller().with("otherIdLookup", false), other("2"), kRefused},
-      {"string", Caller().with("otherIdLookup", "true"), other("2"), kRefused},
-      {"array", Caller().with("otherIdLookup", Array{true}), other("2"), kRefused},
-      {"allowed", Caller().with("allowed"), other("2"), kDone},
-      {"allowed, a string", Caller().with("allowed", "true"), other("2"), kRefused},
-      {"allowed, a dictionary", Caller().with("allowed", Dictionary{}), other("2"), kRefused},
-      {"a short name", unprefixed, other("2"), kRefused},
+      {"otherIdLookup", otherIds(true), other2, kDone},
+      {"otherIdLookup", otherIds(true), create + "7 com.example.new", kDone},
+      {"number 1", otherIds(1), other2, kDone},
+      {"number 0", otherIds(0), other2, kRefused},
+      {"false", otherIds(false), other2, kRefused},
+      {"string", otherIds("true"), other2, kRefused},
+      {"array", otherIds(Array{true}), other2, kRefused},
+      {"allowed", Caller().with("allowed"), other2, kDone},
+      {"allowed, a string", Caller().with("allowed", "true"), other2, kRefused},
+      {"allowed, a dictionary", Caller().with("allowed", Dictionary{}), other2, kRefused},
+      {"a short name", unprefixed, other2, kRefused},
 
-      {"own system container", plain, {"create", "--class", "12"}, kRefused},
-      {"another's system container", plain, other("12"), kRefused},
-      {"well-known, by command 0", plain, create("12", "com.veltra.exampled"), kRefused},
-      {"own in the lookup",
-       lookingUp(Dictionary{{"systemData", Array{"com.example.app"}}}),
-       {"create", "--class", "12"},
-       kDone},
-      {"lookup", lookingUp(Dictionary{{"systemData", otherOnly}}), other("12"), kDone},
-      {"lookup of the group", lookingUp(Dictionary{{"systemGroup", otherOnly}}), other("12"),
-       kRefused},
-      {"lookup of the group", lookingUp(Dictionary{{"systemGroup", otherOnly}}), other("13"),
-       kDone},
-      {"otherIdLookup", Caller().with("otherIdLookup"), other("12"), kDone},
-      {"allowed", Caller().with("allowed"), other("12"), kDone},
-      {"any by its name", named("com.veltra.vaultd"), other("12"), kDone},
+      {"own system container", plain, create + "12", kRefused},
+      {"another's system container", plain, other12, kRefused},
+      {"well-known, by command 0", plain, create + "12 com.veltra.exampled", kRefused},
+      {"own in the lookup", list("systemData", Array{plain.identifier}), create + "12", kDone},
+      {"lookup", list("systemData", otherOnly), other12, kDone},
+      {"lookup of the group", list("systemGroup", otherOnly), other12, kRefused},
+      {"otherIdLookup", otherIds(true), other12, kDone},
+      {"allowed", Caller().with("allowed"), other12, kDone},
+      {"any by its name", named("com.veltra.vaultd"), other12, kDone},
 
-      {"the widget", named("com.veltra.examplewidget"), create("2", "com.veltra.exampleapp"),
-       kDone},
-      {"the widget", named("com.veltra.examplewidget"), create("4", "com.veltra.exampleapp"),
-       kRefused},
-      {"the widget", named("com.veltra.examplewidget"), other("2"), kRefused},
-      {"not the widget", named("com.veltra.examplewidget.x"), create("2", "com.veltra.exampleapp"),
-       kRefused},
-      {"the seeker", named("com.veltra.seekerd"), create("2", "com.veltra.notebook"), kDone},
-      {"the seeker", named("com.veltra.seekerd"), create("2", "com.veltra.exampleapp"), kRefused},
-      {"the shelf", named("com.veltra.shelfd"), create("7", "group.com.veltra.shelf"), kDone},
-      {"the shelf", named("com.veltra.shelfd"), create("2", "group.com.veltra.shelf"), kRefused},
-      {"the installer", named("com.veltra.hatcheryd"), other("1"), kDone},
-      {"the installer", named("com.veltra.hatcheryd"), other("2"), kDone},
-      {"the installer", named("com.veltra.hatcheryd"), other("12"), kDone},
-      {"the installer", named("com.veltra.hatcheryd"), create("13", "com.example.new"), kDone},
-      {"anyone", plain, create("10", "com.veltra.beacond"), kDone},
-      {"anyone", plain, create("2", "com.veltra.beacond"), kRefused},
+      {"the widget", widget, create + "2 com.veltra.exampleapp", kDone},
+      {"the widget", widget, create + "4 com.veltra.exampleapp", kRefused},
+      {"the widget", widget, other2, kRefused},
+      {"the seeker", seeker, create + "2 com.veltra.notebook", kDone},
+      {"the seeker", seeker, create + "2 com.veltra.exampleapp", kRefused},
+      {"the shelf", shelf, create + "7 group.com.veltra.shelf", kDone},
+      {"the shelf", shelf, create + "2 group.com.veltra.shelf", kRefused},
+      {"the installer", hatchery, other1, kDone},
+      {"the installer", hatchery, other2, kDone},
+      {"the installer", hatchery, create + "13 com.example.new", kDone},
+      {"anyone", plain, create + "10 com.veltra.beacond", kDone},
+      {"anyone", plain, create + "2 com.veltra.beacond", kRefused},
+
+      {"own path", plain, "system-path", kRefused},
+      {"another's path", plain, otherPath, kRefused},
+      {"a well-known path", plain, wellknownPath, kDone},
+      {"own path in the lookup", list("systemData", Array{plain.identifier}), "system-path", kDone},
+      {"another's in the lookup", list("systemData", otherOnly), otherPath, kDone},
+      {"an empty lookup", lookingUp(Dictionary{}), otherPath, kRefused},
+      {"otherIdLookup", otherIds(true), otherPath, kDone},
+      {"allowed", Caller().with("allowed"), "system-path", kDone},
+
+      {"listing", lookingUp(Dictionary{}), "list --class 2", kDone},
+      {"listing", lookingUp(Array{}), "list --class 2", kRefused},
+      {"listing", otherIds(true), "list --class 2", kRefused},
+      {"listing", Caller().with("allowed", 1), "list --class 2", kDone},
   });
+  EXPECT_EQ(device_->ask(plain, words(wellknownPath)).text("path"),
+            device_->path("/private/var/containers/Data/System/com.veltra.exampled"));
   EXPECT_EQ(device_->lookup(installer, "com.example.new", 2).code, kNotFound)
       << "what was refused has been made";
   EXPECT_NE(device_->daemonLog().find("com.example.app not entitled to retrieve container class 2 "
                                       "with identifier com.example.other"),
             std::string::npos);
-}
-
-TEST_F(Rights, OfTheCallerOverTheOtherCommands) {
-  device_->start();
-  ASSERT_EQ(device_->create(privilegedCaller(), "com.example.other", 12).code, kDone);
-  const Caller plain;
-  const Caller allowed = Caller().with("allowed");
-  const Caller otherIds = Caller().with("otherIdLookup");
-  const Caller emptyLookup = lookingUp(Dictionary{});
-  const Caller systemLookup =
-      lookingUp(Dictionary{{"systemData", Array{"com.example.other", "com.example.app"}}});
-  const Arguments list{"list", "--class", "2"};
-  const Arguments ownPath{"system-path"};
-  const Arguments otherPath{"system-path", "com.example.other"};
-  const Arguments wellknownPath{"system-path", "com.veltra.exampled"};
-  check({
-      {"plain", plain, list, kRefused},
-      {"otherIdLookup", otherIds, list, kRefused},
-      {"lookup", emptyLookup, list, kDone},
-      {"lookup, an array", lookingUp(Array{}), list, kRefused},
-      {"allowed", allowed, list, kDone},
-      {"allowed 1", Caller().with("allowed", 1), list, kDone},
-      {"allowed 0", Caller().with("allowed", 0), list, kRefused},
-
-      {"plain", plain, ownPath, kRefused},
-      {"plain", plain, otherPath, kRefused},
-      {"plain", plain, wellknownPath, kDone},
-      {"lookup", systemLookup, ownPath, kDone},
-      {"lookup", systemLookup, otherPath, kDone},
-      {"empty lookup", emptyLookup, otherPath, kRefused},
-      {"otherIdLookup", otherIds, otherPath, kDone},
-      {"allowed", allowed, ownPath, kDone},
-
-      {"plain", plain, {"retired"}, kRefused},
-      {"lookup", systemLookup, {"retired"}, kRefused},
-      {"otherIdLookup", otherIds, {"retired"}, kRefused},
-      {"allowed", allowed, {"retired"}, kInvalidCommand},
-
-      {"plain", plain, {"personas"}, kDone},
-  });
-  EXPECT_EQ(device_->ask(plain, wellknownPath).text("path"),
-            device_->path("/private/var/containers/Data/System/com.veltra.exampled"));
 }
 
 // Each entitlement opens its own rows of the table and no others.
@@ -270,7 +238,7 @@ TEST_F(Rights, OfEachEntitlementOverTheRows) {
     for (uint64_t command = 0; command < kCommandCount; ++command) {
       // A well-known name: what anybody may ask of command 15.
       const uint64_t code =
-          codeOf(client, command, Message({{"Identifier", "com.veltra.exampled"}}));
+          codeOf(client, command, Message(Dictionary{{"Identifier", "com.veltra.exampled"}}));
       const bool open = contains(forAnybody, command) || contains(grant.opened, command);
       EXPECT_EQ(code != kRefused, open) << grant.what << ", command " << command;
       if (open && !contains(built, command)) {
@@ -298,7 +266,7 @@ TEST_F(Rights, StrangeRequestsAreAnswered) {
                              Value(true), Value(Array{2})}) {
     EXPECT_EQ(codeOf(client, 0, create(name, wrong)), kUnexpectedClass) << wrong.description();
   }
-  EXPECT_EQ(codeOf(client, 0, Message({{"Identifier", name}})), kUnexpectedClass);
+  EXPECT_EQ(codeOf(client, 0, Message(Dictionary{{"Identifier", name}})), kUnexpectedClass);
   for (const Value& wrong : {Value(5), Value(), Value(true), Value(Array{name}),
                              Value(Value::Data{'a'}), Value(Dictionary{})}) {
     const auto reply = client.call(0, create(wrong, 2));
@@ -348,33 +316,31 @@ TEST_F(Rights, ARequestWithoutReplyContextEndsItsConnection) {
 
 TEST_F(Rights, AProcessWithoutARecordIsNobody) {
   device_->start();
-  const auto askWithoutRecord = [&](const Arguments& arguments) {
-    Arguments command = {"/usr/bin/env", "setpriv",        "--reuid=501",
-                         "--regid=501",  "--clear-groups", Device::program("tessaryctl"),
-                         "--root",       device_->root()};
+  const auto askWithoutRecord = [&](const std::string& question) {
+    std::vector<std::string> command = words(
+        "/usr/bin/env setpriv --reuid=501 --regid=501 "
+        "--clear-groups");
+    command.insert(command.end(), {Device::program("tessaryctl"), "--root", device_->root()});
+    const std::vector<std::string> arguments = words(question);
     command.insert(command.end(), arguments.begin(), arguments.end());
     return runToEnd(command);
   };
-  const struct {
-    Arguments arguments;
-    uint64_t code;
-  } kCases[] = {
-      {{"create", "--class", "2"}, kNoIdentifier},
-      {{"create", "--class", "2", "com.example.app"}, kNoUserIdentity},
-      {{"create", "--class", "2", ""}, kNoUserIdentity},
-      {{"create", "--class", "12", "com.veltra.exampled"}, kNoUserIdentity},
-      {{"create", "--class", "10", "com.veltra.beacond"}, kNoUserIdentity},
-      {{"list", "--class", "2"}, kRefused},
-      {{"system-path"}, kNoIdentifier},
-      {{"system-path", "com.veltra.exampled"}, kNoUserIdentity},
-      {{"retired"}, kRefused},
+  const std::pair<const char*, uint64_t> cases[] = {
+      {"create --class 2", kNoIdentifier},
+      {"create --class 2 com.example.app", kNoUserIdentity},
+      {"create --class 10 com.veltra.beacond", kNoUserIdentity},
+      {"create --class 12 com.veltra.exampled", kNoUserIdentity},
+      {"list --class 2", kRefused},
+      {"system-path", kNoIdentifier},
+      {"system-path com.veltra.exampled", kNoUserIdentity},
+      {"retired", kRefused},
   };
-  for (const auto& [arguments, code] : kCases) {
-    const Finished finished = askWithoutRecord(arguments);
+  for (const auto& [question, code] : cases) {
+    const Finished finished = askWithoutRecord(question);
     EXPECT_NE(finished.errors.find(fmt::format("({})", code)), std::string::npos)
-        << fmt::format("{}", fmt::join(arguments, " ")) << ": " << finished.errors;
+        << question << ": " << finished.errors;
   }
-  const Finished personas = askWithoutRecord({"personas"});
+  const Finished personas = askWithoutRecord("personas");
   EXPECT_EQ(personas.exitStatus, 0) << personas.errors;
   EXPECT_EQ(personas.output, "");
 }

@@ -164,19 +164,24 @@ class Tracer {
  public:
   Tracer(pid_t process, const CallJudge& judge) : process_(process), judge_(judge) {}
 
+  // Stops all threads before the first one goes on: one that runs untraced could make another, or
+  // take the request.
   void attach() {
     // Threads that appear from now on are traced with the one that makes them.
     constexpr long kOptions = PTRACE_O_TRACESYSGOOD | PTRACE_O_TRACECLONE;
-    for (const pid_t thread : threadsOf(process_)) {
-      if (::ptrace(PTRACE_SEIZE, thread, 0, kOptions) != 0) continue;
-      threads_.insert(thread);
-      ::ptrace(PTRACE_INTERRUPT, thread, 0, 0);
+    std::set<pid_t> stopped;
+    for (bool isComplete = false; !isComplete;) {
+      isComplete = true;
+      for (const pid_t thread : threadsOf(process_)) {
+        if (::ptrace(PTRACE_SEIZE, thread, 0, kOptions) != 0) continue;  // traced already, or gone
+        ::ptrace(PTRACE_INTERRUPT, thread, 0, 0);
+        threads_.insert(thread);
+        isComplete = false;
+      }
+      if (threads_.empty()) throw std::runtime_error("the daemon cannot be traced");
+      while (!std::ranges::includes(stopped, threads_)) stopped.insert(await().thread);
     }
-    if (threads_.empty()) throw std::runtime_error("the daemon cannot be traced");
-    // A thread that runs on untraced could take the request.
-    for (std::set<pid_t> waiting = threads_; !waiting.empty();) {
-      waiting.erase(awaitAndResume());
-    }
+    for (const pid_t thread : stopped) ::ptrace(PTRACE_SYSCALL, thread, 0, 0);
   }
 
   void run() {
@@ -208,14 +213,13 @@ class Tracer {
     return stop;
   }
 
-  pid_t awaitAndResume() {
+  void awaitAndResume() {
     const Stop stop = await();
-    if (stop.thread < 0 || stop.isEnd()) return stop.thread;
+    if (stop.thread < 0 || stop.isEnd()) return;
     if (stop.isSystemCall()) systemCall(stop.thread);
     if (!isDone_) ::ptrace(PTRACE_SYSCALL, stop.thread, 0, stop.signal());
     if (isDone_ && !threads_.empty()) ::ptrace(PTRACE_DETACH, stop.thread, 0, 0);
     if (isDone_) threads_.erase(stop.thread);
-    return stop.thread;
   }
 
   void systemCall(pid_t thread) {

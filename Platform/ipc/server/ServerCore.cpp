@@ -43,10 +43,10 @@ ServerCore::ServerCore(FileDescriptor listener, const Tasks& tasks, const System
 
 Result<void> ServerCore::open() {
   if (const auto opened = pool_.open(); !opened) return opened;
-  const MutexLock lock(mutex_);
   timer_ = FileDescriptor(::timerfd_create(CLOCK_MONOTONIC, TFD_CLOEXEC | TFD_NONBLOCK));
   if (!timer_.valid()) return lastErrno();
   if (const auto added = pool_.add(timer_.get(), kTimerToken, EPOLLIN); !added) return added;
+  const MutexLock lock(mutex_);
   return pool_.add(listener_.get(), kListenerToken, 0);
 }
 
@@ -221,13 +221,13 @@ void ServerCore::setTimer(bool running) {
 }
 
 void ServerCore::keepHouse() {
+  uint64_t expirations = 0;
+  while (::read(timer_.get(), &expirations, sizeof expirations) < 0 && errno == EINTR) {
+  }
   std::vector<std::shared_ptr<ServerConnection>> waiting;
   bool wasPaused = false;
   {
     const MutexLock lock(mutex_);
-    uint64_t expirations = 0;
-    while (::read(timer_.get(), &expirations, sizeof expirations) < 0 && errno == EINTR) {
-    }
     for (const uint64_t token : watched_) waiting.push_back(connections_.at(token));
     wasPaused = std::exchange(acceptingPaused_, false);
   }

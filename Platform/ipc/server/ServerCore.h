@@ -70,6 +70,7 @@ class ServerCore : public std::enable_shared_from_this<ServerCore> {
   const Limits limits_;
   UserAccounts accounts_;
 
+  FileDescriptor timer_;  // set by open()
   std::atomic<bool> draining_ = false;
   std::atomic<int> work_ = 0;
 
@@ -78,7 +79,6 @@ class ServerCore : public std::enable_shared_from_this<ServerCore> {
   FileDescriptor listener_ GUARDED_BY(mutex_);  // invalid once nothing is accepted any more
   bool acceptingPaused_ GUARDED_BY(mutex_) = false;
   bool shortageLogged_ GUARDED_BY(mutex_) = false;  // since the last connection was accepted
-  FileDescriptor timer_ GUARDED_BY(mutex_);
   bool timerRuns_ GUARDED_BY(mutex_) = false;
   uint64_t nextToken_ GUARDED_BY(mutex_);
   std::unordered_map<uint64_t, std::shared_ptr<ServerConnection>> connections_ GUARDED_BY(mutex_);

@@ -263,7 +263,10 @@ TEST(TreeTest, CopiesEverythingThatMakesAnItem) {
     ASSERT_EQ(::chown(scratch.path("t/sub").c_str(), 503, 504), 0);
   }
   const auto place = files.locate(scratch.path("t/sub"));
-  ASSERT_TRUE(setACL(place->parent.get(), "fifo", ACLShape::file, 54321));
+  // Nobody but root opens what its list closes.
+  if (isRoot) {
+    ASSERT_TRUE(setACL(place->parent.get(), "fifo", ACLShape::file, 54321));
+  }
   ASSERT_TRUE(setACL(place->parent.get(), "sub", ACLShape::topLevelDirectory, 54321));
   const timespec times[] = {{1000, 0}, {2000, 5}};
   for (const char* name : {"t/link", "t/file", "t/sub", "t"}) {
@@ -295,7 +298,9 @@ TEST(TreeTest, CopiesEverythingThatMakesAnItem) {
   EXPECT_EQ(::getxattr(scratch.path("c/t/file").c_str(), "user.mark", &value, 1), 1);
   EXPECT_EQ(value, 'x');
   EXPECT_EQ(::getxattr(scratch.path("c/t/file").c_str(), longName.c_str(), &value, 1), 1);
-  if (isRoot) EXPECT_EQ(::getxattr(scratch.path("c/t/sub").c_str(), "trusted.mark", &value, 1), 1);
+  if (isRoot) {
+    EXPECT_EQ(::getxattr(scratch.path("c/t/sub").c_str(), "trusted.mark", &value, 1), 1);
+  }
   EXPECT_EQ(scratch.read(scratch.path("c/t/file")), "content");
   EXPECT_EQ(std::filesystem::read_symlink(scratch.path("c/t/link")), "../nowhere");
   EXPECT_EQ(errorOf(files.status(scratch.path("c/t/socket"))), ENOENT);

@@ -118,7 +118,7 @@ class RawClient {
 
 class ServerTest : public testing::Test {
  protected:
-  ~ServerTest() override { gate_.open(); }
+  void TearDown() override { gate_.open(); }
 
   static void echo(Request request) { std::move(*request.reply).send(request.message); }
 

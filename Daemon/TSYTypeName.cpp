@@ -1,0 +1,13 @@
+#include "Daemon/TSYTypeName.h"
+
+#include <cxxabi.h>
+
+#include <cstdlib>
+#include <memory>
+
+std::string TSYTypeName(const std::type_info& type) {
+  int status = 0;
+  const std::unique_ptr<char, decltype(&std::free)> name(
+      abi::__cxa_demangle(type.name(), nullptr, nullptr, &status), &std::free);
+  return status == 0 ? name.get() : type.name();
+}
