@@ -11,23 +11,23 @@ namespace {
 using platform::Errno;
 using platform::FileSystem;
 
-uint64_t sizeByWalking(const TSYURL& url) {
+// Nothing when the size is unknown.
+FileSystem::TreeSize sizeByWalking(const TSYURL& url) {
   const std::string& path = url.path();
   if (path.empty()) {
     TSYLogWrite(TSYLogLevelError, "Failed to get path to url {}", path);
-    return 0;
+    return {};
   }
   const auto size = platform::Platform::current().files.measure(path);
   if (!size) {
     TSYLogWrite(TSYLogLevelError, "Failed to get dirstats on {} using fallback: (err {}) {}", path,
                 size.error().value, size.error().message());
-    return 0;
+    return {};
   }
-  TSY_SIGNPOST_EVENT3(CalculatingDiskUsageNodes, path.c_str(), size->descendants, size->bytes);
   TSYSystemLogWrite(TSYChannel::fs, platform::LogLevel::info,
                     "[{}]: descendants: {}, total size: {}, using fallback", path,
                     size->descendants, size->bytes);
-  return size->bytes;
+  return *size;
 }
 
 }  // namespace
@@ -47,9 +47,9 @@ uint64_t TSYFileManager::fastDiskUsageForURL(const TSYURL& url) {
 
 uint64_t TSYFileManager::diskUsageForURL(const TSYURL& url) {
   TSY_SIGNPOST_BEGIN(CalculatingDiskUsage, &url, url.path().c_str());
-  const uint64_t size = sizeByWalking(url);
-  TSY_SIGNPOST_END(CalculatingDiskUsage, &url, size);
-  return size;
+  const FileSystem::TreeSize size = sizeByWalking(url);
+  TSY_SIGNPOST_END2(CalculatingDiskUsage, &url, size.descendants, size.bytes);
+  return size.bytes;
 }
 
 void TSYFileManager::printDirectoryStructureAtURL(const TSYURL& url) {

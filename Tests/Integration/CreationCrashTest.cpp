@@ -18,6 +18,11 @@ struct Operation {
   Creation creation;
   bool hasPredecessor;  // another container of the class, for a transient one the same, is there
   bool atEveryCall;     // not only around those that change the disk
+
+  // In the name of the test case.
+  friend void PrintTo(const Operation& operation, std::ostream* stream) {
+    *stream << operation.name;
+  }
 };
 
 const Operation kOperations[] = {

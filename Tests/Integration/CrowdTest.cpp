@@ -183,7 +183,7 @@ TEST_F(Crowd, OfReadersLetsWritersThrough) {
   constexpr std::chrono::seconds kLongest{10};
   const Watchdog watchdog(*device_);
   std::vector<tessary::Client> readers = connect(kReaders);
-  tessary::Client writer = connect(1)[0];
+  tessary::Client writer = std::move(connect(1).front());
   ASSERT_TRUE(Creation{}.request(writer).has_value());
 
   std::atomic<bool> isOver = false;

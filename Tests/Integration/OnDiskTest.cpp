@@ -15,7 +15,6 @@
 #include "Tests/Integration/Device.h"
 #include "Tests/Integration/Subprocess.h"
 
-using platform::Value;
 using std::filesystem::exists;
 using tessary::ContainerClass;
 

@@ -18,8 +18,6 @@
 #include "Platform/os/SandboxLog.h"
 #include "Tests/Integration/Device.h"
 
-using platform::ipc::Message;
-
 namespace {
 
 enum Code : uint64_t {

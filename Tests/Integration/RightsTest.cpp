@@ -1,5 +1,4 @@
 // Who may do what: real processes with different identifiers and entitlements ask the real daemon.
-#include <fcntl.h>
 #include <fmt/format.h>
 #include <gtest/gtest.h>
 #include <poll.h>
