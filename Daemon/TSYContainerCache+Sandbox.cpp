@@ -55,8 +55,10 @@ bool TSYContainerCache::shouldRegisterSandboxMappingWithUserIdentity(
       }
     }
     const auto identities = userIdentityCache_.userIdentitiesForBundleIdentifier(bundleIdentifier);
-    const TSYUserIdentityRef personal = userIdentityCache_.userIdentityForPersonalPersona();
-    isMulti = identities.size() >= 2 && personal && identities.contains(personal);
+    if (identities.size() >= 2) {
+      const TSYUserIdentityRef personal = userIdentityCache_.userIdentityForPersonalPersona();
+      isMulti = personal && identities.contains(personal);
+    }
     shouldRegister = isMulti ? !isEnterprise : userIdentity && identities.contains(userIdentity);
   } else if (containerClass != kTSYContainerClassAppGroup) {
     shouldRegister = !isEnterprise;

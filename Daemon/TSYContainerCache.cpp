@@ -1,5 +1,7 @@
 #include "Daemon/TSYContainerCache.h"
 
+#include <malloc.h>
+
 #include <set>
 
 #include "Daemon/TSYCodeSigningMapping.h"
@@ -14,6 +16,9 @@
 using platform::MutexLock;
 
 namespace {
+
+// From this size of a class on, what its scan needed is worth giving back.
+constexpr size_t kManyContainers = 1'000;
 
 const char* mark(bool transient) {
   return transient ? "(transient)" : "";
@@ -101,6 +106,8 @@ TSYResult<TSYContainerCache::ClassCache*> TSYContainerCache::_lock_getCache(
   auto scanned =
       _lock_scanWithOnePersonaList(userIdentity, contentClass, transient, populateSandboxCache);
   TSY_SIGNPOST_END(RebuildingCache, this, contentClass);
+  // A scan needs several times what it leaves: the rest goes back to the system.
+  if (scanned && scanned->containers.size() >= kManyContainers) ::malloc_trim(0);
   if (!scanned) {
     return TSYFailure(TSYErrorCreate(TSYErrorCacheRebuildFailed, scanned.error(), TSYLogIt::yes,
                                      "Cache: [{}]-{}{}: Failed to rebuild",

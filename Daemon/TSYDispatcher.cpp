@@ -141,12 +141,14 @@ void TSYProcessRelayEvent(platform::ipc::Request request) {
   TSYClientIdentityRef client;
   const uint64_t code = processCommand(command, peer, event, client);
 
+  // The client is not kept waiting for the log.
+  if (event.replyPort && dispatcherReplies(command, code)) {
+    event.reply.set("ReplyError", code);
+    std::move(*event.replyPort).send(event.reply);
+  }
   const std::string_view clientName =
       client ? std::string_view(client->bundleIdentifier()) : std::string_view("<unknown>");
   TSY_SIGNPOST_END2(RelayEventProcessing, &request, command, clientName.data());
   TSYSystemLogWrite(TSYChannel::relay, LogLevel::standard, "command={}, client={}, error={}",
                     command, clientName, code);
-  if (!event.replyPort || !dispatcherReplies(command, code)) return;
-  event.reply.set("ReplyError", code);
-  std::move(*event.replyPort).send(event.reply);
 }

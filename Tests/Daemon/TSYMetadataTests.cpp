@@ -75,7 +75,7 @@ TEST(TSYMetadata, whatIsWrittenIsRead) {
     EXPECT_EQ(metadata->url().path(), device.path(kContainer));
     EXPECT_EQ(metadata->userManagedAssetsDirName(), test.assets);
     ASSERT_EQ(metadata->info() != nullptr, test.info != nullptr);
-    if (test.info) EXPECT_EQ(*metadata->info(), *test.info);
+    EXPECT_TRUE(!test.info || *metadata->info() == *test.info);
 
     EXPECT_EQ(TSYFileManager::defaultManager()
                   .dataProtectionClassOfItemAtURL(TSYURL(device.path(kFile)))

@@ -31,14 +31,15 @@ TEST(TSYRequestResolvers, theClientsOwnIdentifierStandsIn) {
   const TSYClientConnection client =
       unentitledConnection(clientWith("com.client", users().userIdentityForPersonalPersona()));
   const TSYClientConnection nobody = unentitledConnection(nullptr);
-  const Message with({{"Identifier", "com.named"}});
-  const Message without({{"Identifier", 7}});
+  const Message with(Value::Dictionary{{"Identifier", "com.named"}});
+  const Message without(Value::Dictionary{{"Identifier", 7}});
   constexpr auto kFallback = TSYIdentifierFallback::client;
   EXPECT_EQ(TSYResolveIdentifier(with, client, kFallback), "com.named");
   EXPECT_EQ(TSYResolveIdentifier(without, client, kFallback), "com.client");
   EXPECT_EQ(TSYResolveIdentifier(without, client, TSYIdentifierFallback::none), std::nullopt);
   EXPECT_EQ(TSYResolveIdentifier(without, nobody, kFallback), std::nullopt);
-  EXPECT_EQ(TSYResolveIdentifier(Message({{"Identifier", ""}}), client, kFallback), "");
+  const Message empty(Value::Dictionary{{"Identifier", ""}});
+  EXPECT_EQ(TSYResolveIdentifier(empty, client, kFallback), "");
 }
 
 TEST(TSYRequestResolvers, whoseContainerAnIdentifierMeans) {

@@ -183,7 +183,9 @@ class Attack : public ::testing::Test {
   }
 
   uint64_t codeOf(const tessary::Result<tessary::Container>& result) const {
-    if (result) EXPECT_TRUE(result->path.starts_with(home())) << result->path;
+    if (result) {
+      EXPECT_TRUE(result->path.starts_with(home())) << result->path;
+    }
     EXPECT_TRUE(std::ranges::count(kSensible, code(result)))
         << code(result) << (result ? "" : result.error().text);
     return code(result);

@@ -144,8 +144,9 @@ INSTANTIATE_TEST_SUITE_P(OfADirectory, AttackDuringRequests,
                          ::testing::Values("Containers", "Containers/Staging", "Containers/Temp",
                                            "Containers/Data", "Containers/Data/Application",
                                            "Containers/Temp/Data/Application", ""),
-                         [](const auto& info) {
-                           std::string name = info.param[0] == '\0' ? "InContainers" : info.param;
+                         [](const auto& tested) {
+                           std::string name =
+                               tested.param[0] == '\0' ? "InContainers" : tested.param;
                            std::erase(name, '/');
                            return name;
                          });

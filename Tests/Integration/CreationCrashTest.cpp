@@ -103,7 +103,7 @@ class CreationCrash : public ::testing::TestWithParam<Operation> {
   bool isMapped(const std::string& path) const {
     std::ifstream log(device_->path("/run/tessary/sandbox/mappings"));
     const std::string text{std::istreambuf_iterator<char>(log), {}};
-    return text.ends_with('\t' + path + '\n') || text.find('\t' + path + '\n') != std::string::npos;
+    return text.find('\t' + path + '\n') != std::string::npos;
   }
 
   // Kills the daemon at call `number`, starts it again and looks at what there is.
@@ -134,7 +134,7 @@ class CreationCrash : public ::testing::TestWithParam<Operation> {
     EXPECT_EQ(next->existed, !creation().transient && alive > others);
     EXPECT_EQ(defectOf(creation(), next->path, model_), "");
     EXPECT_EQ(countLive(), others + 1);
-    if (!creation().transient) EXPECT_TRUE(isMapped(next->path));
+    EXPECT_TRUE(creation().transient || isMapped(next->path));
   }
 
   std::optional<Device> device_;
@@ -146,10 +146,11 @@ class CreationCrash : public ::testing::TestWithParam<Operation> {
 TEST_P(CreationCrash, LeavesAWholeContainerOrNone) {
   const std::vector<FileCall> calls = learn();
   ASSERT_GT(calls.size(), 50U);
+  size_t candidates = 0;
   size_t points = 0;
   for (size_t number = 0; number < calls.size() && !HasFailure(); ++number) {
-    if (number % kSanitizedStride != 0) continue;
     if (!calls[number].changes && !operation().atEveryCall) continue;
+    if (candidates++ % kSanitizedStride != 0) continue;
     ++points;
     crash(number, Verdict::Kind::killBefore);
     if (!calls[number].changes) continue;
@@ -163,6 +164,6 @@ TEST_P(CreationCrash, LeavesAWholeContainerOrNone) {
 }
 
 INSTANTIATE_TEST_SUITE_P(Each, CreationCrash, ::testing::ValuesIn(kOperations),
-                         [](const auto& info) { return std::string(info.param.name); });
+                         [](const auto& each) { return std::string(each.param.name); });
 
 }  // namespace

@@ -181,7 +181,7 @@ TEST_P(CreationFaultOf, GivesTheCodeOfTheStepAndLeavesNothing) {
     if (!failOnce(newCreation(GetParam()), number, error)) break;
     ++faults;
   }
-  EXPECT_GT(faults, 100 / kSanitizedStride);
+  EXPECT_GT(faults, 50 / kSanitizedStride);
   fmt::print("class {:2} {:4} faults\n", GetParam(), faults);
 }
 
@@ -226,7 +226,7 @@ TEST_P(CreationFaultOf, SurvivesADiskThatIsGone) {
         progress.step().code == kMetadata.code || progress.step().code == kList.code ||
         progress.step().code == kSubdirectories.code || progress.step().code == kMoving.code;
     // What is in staging cannot be got rid of either.
-    if (isBuilt) EXPECT_EQ(code, 9U) << progress.step().name;
+    EXPECT_TRUE(!isBuilt || code == 9U) << code << ' ' << progress.step().name;
     EXPECT_NE(code, 0U);
     EXPECT_EQ(itemsIn(*device_, creation.classDirectory()).size(),
               live_ + (code == kSuccess ? 1 : 0));
@@ -241,7 +241,7 @@ TEST_P(CreationFaultOf, SurvivesADiskThatIsGone) {
 }
 
 INSTANTIATE_TEST_SUITE_P(Class, CreationFaultOf, ::testing::Values(2, 12, 13),
-                         [](const auto& info) { return std::to_string(info.param); });
+                         [](const auto& each) { return std::to_string(each.param); });
 
 struct Message {
   uint64_t containerClass;

@@ -14,7 +14,7 @@
 
 // Tests that go through all points of an operation take every so manieth of them.
 #ifdef TESSARY_SANITIZED
-constexpr size_t kSanitizedStride = 9;
+constexpr size_t kSanitizedStride = 4;
 #else
 constexpr size_t kSanitizedStride = 1;
 #endif

@@ -94,12 +94,22 @@ uint64_t openFlags(pid_t process, const uint64_t* arguments, bool hasStructure) 
   return how.flags;
 }
 
+// A sanitizer probes memory by writing it to a pipe.
+bool isOfAFile(pid_t process, uint64_t descriptor) {
+  std::error_code gone;
+  const std::string link = "/proc/" + std::to_string(process) + "/fd/" + std::to_string(descriptor);
+  return std::filesystem::read_symlink(link, gone).string().starts_with('/');
+}
+
 std::optional<FileCall> fileCall(pid_t process, const SystemCallInfo& info) {
   const auto* const known = std::ranges::find_if(kFileCalls, [&](const KnownCall& call) {
     return static_cast<uint64_t>(call.number) == info.entry.nr;
   });
   if (known == std::end(kFileCalls)) return std::nullopt;
   FileCall call{.name = known->name, .path = {}, .changes = known->changes};
+  if (known->pathArgument == kNoPath && !isOfAFile(process, info.entry.args[0])) {
+    return std::nullopt;
+  }
   if (known->pathArgument != kNoPath) {
     call.path = textAt(process, info.entry.args[known->pathArgument]);
   }

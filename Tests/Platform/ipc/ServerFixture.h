@@ -2,6 +2,7 @@
 #pragma once
 
 #include <gtest/gtest.h>
+#include <sys/ioctl.h>
 #include <sys/socket.h>
 #include <sys/time.h>
 
@@ -105,6 +106,11 @@ class RawClient {
   bool isOpen() {
     uint8_t byte = 0;
     return ::recv(socket_.get(), &byte, 1, MSG_DONTWAIT | MSG_PEEK) < 0 && errno == EAGAIN;
+  }
+  // Whether the service has read all that was sent.
+  bool isAllRead() const {
+    int waiting = -1;
+    return ::ioctl(socket_.get(), TIOCOUTQ, &waiting) == 0 && waiting == 0;
   }
 
  private:
