@@ -65,6 +65,16 @@ class Staging {
   bool over_ = false;
 };
 
+// Whose the container is: of global classes the default user's, whoever asked for it, as it will be
+// when its metadata file is read again.
+TSYUserIdentityRef ownerOf(const TSYContainerIdentity& identity) {
+  if (TSYUserIdentity::isUserIdentityRequiredForContainerClass(identity.containerClass())) {
+    return identity.userIdentity();
+  }
+  const TSYUserIdentityRef defaultUser = TSYUserIdentityCache::defaultUserIdentity();
+  return defaultUser ? defaultUser : identity.userIdentity();
+}
+
 // The owner of what is inside a container.
 uid_t ownerOfContent(const TSYMetadata& metadata) {
   if (TSYIsSystemClass(metadata.containerClass())) return platform::kNobodyAccount;
@@ -181,7 +191,7 @@ TSYResult<TSYMetadata> TSYClientConnection::buildInStaging(const TSYContainerIde
                                                            const TSYURL& stagingURL) {
   // The container's UUID has nothing to do with its directory's name.
   auto concrete = TSYConcreteContainerIdentity::containerIdentityWithUUID(
-      UUID::random(), identity.userIdentity(), identity.identifier(), identity.containerClass());
+      UUID::random(), ownerOf(identity), identity.identifier(), identity.containerClass());
   if (!concrete) return TSYFailure(std::move(concrete.error()));
   TSYMetadata metadata(*concrete, /*info=*/nullptr, stagingURL, std::nullopt);
   if (auto filled = fillStaging(metadata, stagingURL); !filled) {

@@ -58,7 +58,8 @@ void SerialQueue::async(std::function<void()> work) {
   {
     const MutexLock lock(mutex_);
     entries_.push_back({nextTicket_++, std::move(work)});
-    if (!thread_.joinable()) thread_ = std::thread([this] { runThread(); });
+    // While the queue ends its thread is being waited for, and takes this work too.
+    if (!thread_.joinable() && !ending_) thread_ = std::thread([this] { runThread(); });
   }
   changed_.notifyAll();
 }

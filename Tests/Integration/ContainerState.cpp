@@ -128,14 +128,16 @@ std::string defectOf(const Creation& creation, const std::string& path,
   return metadataDefect(creation, path + kMetadataFile);
 }
 
-bool comesToBeClean(const Device& device, const Creation& creation, const std::string& passedOver) {
+std::string litterThatStays(const Device& device, const Creation& creation,
+                            const std::string& passedOver) {
   const auto deadline = std::chrono::steady_clock::now() + kPatience;
   for (;;) {
-    const auto staged = itemsIn(device, creation.stagingDirectory());
-    const bool isClean =
-        itemsIn(device, kDeathRow).empty() &&
-        std::ranges::all_of(staged, [&](const auto& name) { return name.starts_with(passedOver); });
-    if (isClean || std::chrono::steady_clock::now() > deadline) return isClean;
+    std::string litter;
+    for (const std::string& name : itemsIn(device, kDeathRow)) litter += " on death row: " + name;
+    for (const std::string& name : itemsIn(device, creation.stagingDirectory())) {
+      if (!name.starts_with(passedOver)) litter += " in staging: " + name;
+    }
+    if (litter.empty() || std::chrono::steady_clock::now() > deadline) return litter;
     std::this_thread::sleep_for(std::chrono::milliseconds(1));
   }
 }

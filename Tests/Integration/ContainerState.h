@@ -39,7 +39,7 @@ std::map<std::string, std::string> pictureOf(const std::string& container);
 std::string defectOf(const Creation& creation, const std::string& path,
                      const std::map<std::string, std::string>& model);
 
-// Whether staging and death row come to be empty within some seconds. `passedOver` begins the names
-// of items in staging that may stay.
-bool comesToBeClean(const Device& device, const Creation& creation,
+// Waits until staging and death row are empty; what is still there after some seconds, empty when
+// nothing is. `passedOver` begins the names of items in staging that may stay.
+std::string litterThatStays(const Device& device, const Creation& creation,
                     const std::string& passedOver = "(none)");

@@ -124,7 +124,7 @@ class CreationCrash : public ::testing::TestWithParam<Operation> {
     if (!itemsIn(*device_, creation().stagingDirectory()).empty()) ++litter_;
 
     device_->start();
-    EXPECT_TRUE(comesToBeClean(*device_, creation()));
+    EXPECT_EQ(litterThatStays(*device_, creation()), "");
     tessary::Client client = connect();
     if (!creation().transient) {
       EXPECT_EQ(creation().lookUp(client).has_value(), alive > others);

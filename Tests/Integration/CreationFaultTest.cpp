@@ -134,7 +134,7 @@ class CreationFault : public ::testing::Test {
 
   // Nothing half-built is left, and the next request has its container.
   void expectSound(const Creation& creation, bool wasMade) {
-    EXPECT_TRUE(comesToBeClean(*device_, creation, kTemporaryMetadata));
+    EXPECT_EQ(litterThatStays(*device_, creation, kTemporaryMetadata), "");
     EXPECT_EQ(itemsIn(*device_, creation.classDirectory()).size(), live_ + (wasMade ? 1 : 0));
     const auto next = creation.request(*client_);
     ASSERT_TRUE(next.has_value()) << next.error().text << next.error().code;
@@ -237,7 +237,7 @@ TEST_P(CreationFaultOf, SurvivesADiskThatIsGone) {
   }
   EXPECT_FALSE(itemsIn(*device_, first.stagingDirectory()).empty());
   start();
-  EXPECT_TRUE(comesToBeClean(*device_, first));
+  EXPECT_EQ(litterThatStays(*device_, first), "");
 }
 
 INSTANTIATE_TEST_SUITE_P(Class, CreationFaultOf, ::testing::Values(2, 12, 13),

@@ -152,8 +152,8 @@ TEST_F(Crowd, IsGivenOneContainerOfEachIdentity) {
   for (const char* directory : kClassDirectories) onDisk += itemsIn(*device_, directory).size();
   EXPECT_EQ(onDisk, std::size(kIdentities));
   EXPECT_EQ(clients[0].containersOfClass(2)->size(), 3U);
-  EXPECT_TRUE(comesToBeClean(*device_, {.containerClass = 2}));
-  EXPECT_TRUE(comesToBeClean(*device_, {.containerClass = 12}));
+  EXPECT_EQ(litterThatStays(*device_, {.containerClass = 2}), "");
+  EXPECT_EQ(litterThatStays(*device_, {.containerClass = 12}), "");
 }
 
 // Of a transient identity everybody gets a new container, and the last one stays.
@@ -176,7 +176,7 @@ TEST_F(Crowd, LeavesOneTransientContainer) {
   const auto listed = clients[0].containersOfClass(2, /*transient=*/true);
   ASSERT_EQ(listed->size(), 1U);
   EXPECT_TRUE(uuids.contains(listed->front().uuid.string()));
-  EXPECT_TRUE(comesToBeClean(*device_, creation));
+  EXPECT_EQ(litterThatStays(*device_, creation), "");
 }
 
 TEST_F(Crowd, OfReadersLetsWritersThrough) {

@@ -206,8 +206,8 @@ TEST_F(PowerCut, LeavesContainersWholeOrAbsent) {
     EXPECT_TRUE(std::ranges::includes(there, synced));
     lost += static_cast<size_t>(
         std::ranges::count_if(answered, [&](const auto& id) { return !there.contains(id); }));
-    EXPECT_TRUE(comesToBeClean(*device_, kKinds[0]));
-    EXPECT_TRUE(comesToBeClean(*device_, kKinds[1]));
+    EXPECT_EQ(litterThatStays(*device_, kKinds[0]), "");
+    EXPECT_EQ(litterThatStays(*device_, kKinds[1]), "");
     client = connect();
     EXPECT_TRUE(newCreation().request(client).has_value());
   }

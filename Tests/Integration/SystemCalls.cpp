@@ -208,6 +208,7 @@ class Tracer {
     bool isEnd() const { return !WIFSTOPPED(status); }
     bool isSystemCall() const { return WSTOPSIG(status) == (SIGTRAP | 0x80); }
     bool isEvent() const { return status >> 16 != 0; }
+    bool isClone() const { return status >> 8 == (SIGTRAP | PTRACE_EVENT_CLONE << 8); }
     // What goes on to the thread when it is resumed.
     int signal() const { return isSystemCall() || isEvent() ? 0 : WSTOPSIG(status); }
   };
@@ -220,6 +221,12 @@ class Tracer {
     if (stop.thread < 0) threads_.clear();
     if (stop.thread > 0 && stop.isEnd()) threads_.erase(stop.thread);
     if (stop.thread > 0 && !stop.isEnd()) threads_.insert(stop.thread);
+    if (stop.thread > 0 && stop.isClone()) {
+      // Traced already, and not to be left behind before it has stopped for the first time.
+      unsigned long made = 0;
+      ::ptrace(PTRACE_GETEVENTMSG, stop.thread, 0, &made);
+      threads_.insert(static_cast<pid_t>(made));
+    }
     return stop;
   }
 

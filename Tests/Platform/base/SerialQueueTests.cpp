@@ -155,5 +155,17 @@ TEST(SerialQueue, ManyThreadsNeverMeetOnIt) {
   queue.sync([&] { EXPECT_EQ(std::accumulate(rounds.begin(), rounds.end(), 0), 6 * kRounds); });
 }
 
+TEST(SerialQueue, WorkMayHandInMoreWorkWhileTheQueueEnds) {
+  std::atomic<int> ran = 0;
+  {
+    SerialQueue queue("com.example.ending");
+    queue.async([&] {
+      std::this_thread::sleep_for(30ms);  // until the end has begun
+      queue.async([&] { ++ran; });
+    });
+  }
+  EXPECT_EQ(ran, 1);
+}
+
 }  // namespace
 }  // namespace platform
