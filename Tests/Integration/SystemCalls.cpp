@@ -185,7 +185,7 @@ class Tracer {
       for (const pid_t thread : threadsOf(process_)) {
         if (::ptrace(PTRACE_SEIZE, thread, 0, kOptions) != 0) continue;  // traced already, or gone
         ::ptrace(PTRACE_INTERRUPT, thread, 0, 0);
-        threads_.insert(thread);
+        add(thread);
         isComplete = false;
       }
       if (threads_.empty()) throw std::runtime_error("the daemon cannot be traced");
@@ -219,15 +219,23 @@ class Tracer {
       stop.thread = ::waitpid(-1, &stop.status, __WALL);
     } while (stop.thread < 0 && errno == EINTR);
     if (stop.thread < 0) threads_.clear();
-    if (stop.thread > 0 && stop.isEnd()) threads_.erase(stop.thread);
-    if (stop.thread > 0 && !stop.isEnd()) threads_.insert(stop.thread);
-    if (stop.thread > 0 && stop.isClone()) {
+    if (stop.thread < 0 || stop.isEnd()) {
+      threads_.erase(stop.thread);
+      return stop;
+    }
+    add(stop.thread);
+    if (stop.isClone()) {
       // Traced already, and not to be left behind before it has stopped for the first time.
       unsigned long made = 0;
       ::ptrace(PTRACE_GETEVENTMSG, stop.thread, 0, &made);
-      threads_.insert(static_cast<pid_t>(made));
+      add(static_cast<pid_t>(made));
     }
     return stop;
+  }
+
+  // A new thread may stop, and be gone again, before the one that made it tells of it.
+  void add(pid_t thread) {
+    if (seen_.insert(thread).second) threads_.insert(thread);
   }
 
   void awaitAndResume() {
@@ -294,7 +302,8 @@ class Tracer {
 
   const pid_t process_;
   const CallJudge& judge_;
-  std::set<pid_t> threads_;
+  std::set<pid_t> threads_;  // those that are traced
+  std::set<pid_t> seen_;
   std::map<pid_t, uint64_t> inCall_;  // the number of the call that a thread is in
   pid_t serving_ = -1;
   Verdict verdict_;  // of the call that the serving thread is in
