@@ -77,13 +77,14 @@ bool TSYContainerCache::setSandboxContainerMappingForUserIdentity(
     const TSYUserIdentityRef& userIdentity, const std::string& identifier,
     TSYContainerClass containerClass, const std::optional<TSYURL>& url) {
   if (TSYIsBundleClass(containerClass)) return true;
+  if (TSYIsPerUserClass(containerClass) && !userIdentity) return false;
   const std::optional<uint32_t> itemType = sandboxItemType(containerClass);
   if (!itemType) {
     TSYLogWrite(TSYLogLevelError, "Unsupported class for setting sandbox container mapping: {}",
                 containerClass);
     return false;
   }
-  const bool perUser = TSYIsPerUserClass(containerClass) && userIdentity;
+  const bool perUser = TSYIsPerUserClass(containerClass);
   const platform::SandboxMappingKey key{
       .uid = perUser ? userIdentity->posixUIDForContainerClass(containerClass)
                      : platform::kSystemAccount,
@@ -115,16 +116,19 @@ bool TSYContainerCache::setSandboxContainerMappingForUserIdentity(
   return true;
 }
 
-void TSYContainerCache::_lock_pushMapping(const TSYMetadata& metadata) {
-  if (!shouldRegisterSandboxMappingWithUserIdentity(metadata.userIdentity(), metadata.identifier(),
-                                                    metadata.containerClass())) {
-    return;
-  }
-  if (!setSandboxContainerMappingForUserIdentity(metadata.userIdentity(), metadata.identifier(),
-                                                 metadata.containerClass(), metadata.url())) {
-    TSYLogWrite(TSYLogLevelError,
-                "Failed to set container mapping during create/lookup operation of {}, {}",
-                metadata.identifier(), metadata.containerClass());
+void TSYContainerCache::_lock_pushMappings(const ClassCache& cache) {
+  const platform::Sandbox::Batch batch(Platform::current().sandbox);
+  for (const TSYMetadataRef& container : cache.containers) {
+    const TSYUserIdentityRef& owner = container->userIdentity();
+    const std::string& identifier = container->identifier();
+    const TSYContainerClass containerClass = container->containerClass();
+    if (shouldRegisterSandboxMappingWithUserIdentity(owner, identifier, containerClass) &&
+        !setSandboxContainerMappingForUserIdentity(owner, identifier, containerClass,
+                                                   container->url())) {
+      TSYLogWrite(TSYLogLevelError,
+                  "Failed to set container mapping during create/lookup operation of {}, {}",
+                  identifier, containerClass);
+    }
   }
 }
 
@@ -136,8 +140,8 @@ void TSYContainerCache::invalidateUserIdentity(const TSYUserIdentityRef& userIde
     const std::string key = cacheKey(userIdentity, containerClass);
     if (const auto live = liveContainerCache_.find(key); live != liveContainerCache_.end()) {
       for (const TSYMetadataRef& container : live->second.containers) {
-        if (!setSandboxContainerMappingForUserIdentity(userIdentity, container->identifier(),
-                                                       containerClass, std::nullopt)) {
+        if (!setSandboxContainerMappingForUserIdentity(
+                container->userIdentity(), container->identifier(), containerClass, std::nullopt)) {
           TSYLogWrite(TSYLogLevelError, "Failed to remove container mapping of [{}], class: {}",
                       container->identifier(), containerClass);
         }

@@ -24,6 +24,26 @@ const char* mark(bool transient) {
   return transient ? "(transient)" : "";
 }
 
+// Whether a metadata file is not there any more. What cannot be told for now is no reason to forget
+// a container.
+bool hasGone(const TSYURL& file) {
+  const auto status = platform::Platform::current().files.status(file.path());
+  if (status) return false;
+  const int error = status.error().value;
+  if (error == ENOENT || error == ENOTDIR || error == ELOOP) return true;
+  TSYLogWrite(TSYLogLevelError, "Failed to determine if {} exists: {}", file.path(),
+              status.error().message());
+  return false;
+}
+
+// A metadata file that could not be read for want of descriptors or memory says nothing about its
+// container: the scan would miss it for good.
+bool isOutOfResources(const TSYError& error) {
+  const auto& underlying = error.underlying();
+  return underlying && (underlying->isPosix(EMFILE) || underlying->isPosix(ENFILE) ||
+                        underlying->isPosix(ENOMEM));
+}
+
 std::string identifierOf(const TSYUserIdentityRef& userIdentity) {
   return userIdentity ? userIdentity->identifier() : std::string();
 }
@@ -103,8 +123,9 @@ TSYResult<TSYContainerCache::ClassCache*> TSYContainerCache::_lock_getCache(
   if (const auto found = caches.find(key); found != caches.end()) return &found->second;
   TSYLogWrite(TSYLogLevelDebug, "Rebuilding container class cache: {}{}", key, mark(transient));
   TSY_SIGNPOST_BEGIN(RebuildingCache, this, contentClass);
-  auto scanned =
-      _lock_scanWithOnePersonaList(userIdentity, contentClass, transient, populateSandboxCache);
+  auto scanned = _lock_scanWithOnePersonaList(userIdentity, contentClass, transient);
+  // Only what becomes an entry is told to the sandbox: an invalidation finds it there.
+  if (scanned && populateSandboxCache && !transient) _lock_pushMappings(*scanned);
   TSY_SIGNPOST_END(RebuildingCache, this, contentClass);
   // A scan needs several times what it leaves: the rest goes back to the system.
   if (scanned && scanned->containers.size() >= kManyContainers) ::malloc_trim(0);
@@ -122,10 +143,9 @@ TSYResult<TSYContainerCache::ClassCache*> TSYContainerCache::_lock_getCache(
 // there would be incomplete, and nothing would drop it when the persona comes back: only those that
 // a list loses are invalidated.
 TSYResult<TSYContainerCache::ClassCache> TSYContainerCache::_lock_scanWithOnePersonaList(
-    const TSYUserIdentityRef& userIdentity, TSYContainerClass contentClass, bool transient,
-    bool populateSandboxCache) {
+    const TSYUserIdentityRef& userIdentity, TSYContainerClass contentClass, bool transient) {
   if (!userIdentity || !TSYIsPerUserClass(contentClass)) {
-    return _lock_scan(userIdentity, contentClass, transient, populateSandboxCache);
+    return _lock_scan(userIdentity, contentClass, transient);
   }
   for (;;) {
     const auto generation = userIdentityCache_.generationOfListKnowing(*userIdentity);
@@ -133,14 +153,13 @@ TSYResult<TSYContainerCache::ClassCache> TSYContainerCache::_lock_scanWithOnePer
       return TSYFailure(TSYPosixErrorCreate(platform::Errno{ENOENT}, "the persona of {} has gone",
                                             cacheKey(userIdentity, contentClass)));
     }
-    auto scanned = _lock_scan(userIdentity, contentClass, transient, populateSandboxCache);
+    auto scanned = _lock_scan(userIdentity, contentClass, transient);
     if (userIdentityCache_.generationOfListKnowing(*userIdentity) == generation) return scanned;
   }
 }
 
 TSYResult<TSYContainerCache::ClassCache> TSYContainerCache::_lock_scan(
-    const TSYUserIdentityRef& userIdentity, TSYContainerClass contentClass, bool transient,
-    bool populateSandboxCache) {
+    const TSYUserIdentityRef& userIdentity, TSYContainerClass contentClass, bool transient) {
   const auto directory =
       TSYGlobalConfiguration::sharedInstance().containerDirectoryURLForUserIdentity(
           userIdentity, contentClass, transient);
@@ -152,17 +171,18 @@ TSYResult<TSYContainerCache::ClassCache> TSYContainerCache::_lock_scan(
   if (!items) return TSYFailure(std::move(items.error()));
 
   ClassCache cache{std::make_shared<const std::string>(directory->path()), {}};
-  const platform::Sandbox::Batch batch(platform::Platform::current().sandbox);
   for (const TSYURL& item : *items) {
     if (!containerURLIsValidForContainerClass(item, contentClass)) continue;
     auto metadata =
         TSYMetadata::readAndValidateMetadataAtUrl(item, userIdentity,
                                                   /*checkClassPath=*/true, userIdentityCache_);
+    if (!metadata && isOutOfResources(metadata.error())) {
+      return TSYFailure(std::move(metadata.error()));
+    }
     if (!metadata) continue;
     metadata->setURL(cache.directory, std::string(item.lastPathComponent()));
     metadata->setTransient(transient);
     metadata->setExisted(true);
-    if (populateSandboxCache && !transient) _lock_pushMapping(*metadata);
     cache.store(std::make_shared<const TSYMetadata>(std::move(*metadata)));
   }
   return cache;
@@ -214,14 +234,14 @@ TSYMetadataRef TSYContainerCache::containerForContainerIdentity(
 TSYResult<void> TSYContainerCache::checkStillOnDisk(const Found& found, bool transient) {
   const TSYMetadata& container = *found.container;
   const TSYURL file = container.metadataFileURL();
-  if (TSYFileManager::defaultManager().itemExistsAtURL(file)) return {};
+  if (!hasGone(file)) return {};
   TSYError inconsistent =
       TSYErrorCreate(TSYErrorCacheInconsistent, std::nullopt, TSYLogIt::yes,
                      "Cache: {}{}: INCONSISTENT-No Metadata at: {} for id: {}, class: {}",
                      cacheKey(found.keyedUnder, container.containerClass()), mark(transient),
                      file.path(), container.identifier(), container.containerClass());
-  const auto removed =
-      remove(found.keyedUnder, container.containerClass(), container.identifier(), transient);
+  const auto removed = remove(found.keyedUnder, container.containerClass(), container.identifier(),
+                              transient, found.container);
   if (!removed) {
     TSYLogWrite(TSYLogLevelError,
                 "Failed to remove from cache user: {}, id: {}, class: {}, transient: {:d} : {}",
@@ -342,32 +362,36 @@ TSYResult<void> TSYContainerCache::removeContainerForUserIdentity(
     const TSYUserIdentityRef& userIdentity, TSYContainerClass contentClass,
     const std::string& identifier, bool transient) {
   return TSYCatchingExceptions(
-      [&] { return remove(userIdentity, contentClass, identifier, transient); });
+      [&] { return remove(userIdentity, contentClass, identifier, transient, nullptr); });
 }
 
 TSYResult<void> TSYContainerCache::remove(const TSYUserIdentityRef& userIdentity,
                                           TSYContainerClass contentClass,
-                                          const std::string& identifier, bool transient) {
+                                          const std::string& identifier, bool transient,
+                                          const TSYMetadataRef& onlyIf) {
   if (!TSYIsContainerClass(contentClass)) {
     return TSYFailure(TSYErrorCreate(TSYErrorCacheInvalidInput, std::nullopt, TSYLogIt::yes,
                                      "Invalid Content Class: {}",
                                      static_cast<int64_t>(contentClass)));
   }
   bool shouldRegister = false;
+  TSYUserIdentityRef owner = userIdentity;
   {
     const MutexLock lock(cacheLock_);
     auto cache = _lock_getCache(userIdentity, contentClass, transient,
                                 /*populateSandboxCache=*/true);
     if (!cache) return TSYFailure(std::move(cache.error()));
-    if (const TSYMetadataRef container = (*cache)->find(identifier)) {
+    const TSYMetadataRef container = (*cache)->find(identifier);
+    if (onlyIf && container != onlyIf) return {};
+    if (container) {
+      // The sandbox knows it by its owner, which need not be who asks.
+      owner = container->userIdentity();
       (*cache)->containers.erase(container);
     }
-    shouldRegister =
-        shouldRegisterSandboxMappingWithUserIdentity(userIdentity, identifier, contentClass);
+    shouldRegister = shouldRegisterSandboxMappingWithUserIdentity(owner, identifier, contentClass);
   }
   if (shouldRegister && !transient &&
-      !setSandboxContainerMappingForUserIdentity(userIdentity, identifier, contentClass,
-                                                 std::nullopt)) {
+      !setSandboxContainerMappingForUserIdentity(owner, identifier, contentClass, std::nullopt)) {
     TSYLogWrite(TSYLogLevelError, "Failed to remove container mapping of {}, {}", identifier,
                 contentClass);
   }

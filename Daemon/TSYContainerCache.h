@@ -109,13 +109,12 @@ class TSYContainerCache : public TSYUserIdentityCacheObserver {
                                         bool populateSandboxCache) REQUIRES(cacheLock_);
   // Fails when the persona of `userIdentity` has gone.
   TSYResult<ClassCache> _lock_scanWithOnePersonaList(const TSYUserIdentityRef& userIdentity,
-                                                     TSYContainerClass contentClass, bool transient,
-                                                     bool populateSandboxCache)
+                                                     TSYContainerClass contentClass, bool transient)
       REQUIRES(cacheLock_);
   TSYResult<ClassCache> _lock_scan(const TSYUserIdentityRef& userIdentity,
-                                   TSYContainerClass contentClass, bool transient,
-                                   bool populateSandboxCache) REQUIRES(cacheLock_);
-  void _lock_pushMapping(const TSYMetadata& metadata) REQUIRES(cacheLock_);
+                                   TSYContainerClass contentClass, bool transient)
+      REQUIRES(cacheLock_);
+  void _lock_pushMappings(const ClassCache& cache) REQUIRES(cacheLock_);
   // A container and the identity under whose key it is kept.
   struct Found {
     TSYUserIdentityRef keyedUnder;
@@ -136,8 +135,10 @@ class TSYContainerCache : public TSYUserIdentityCacheObserver {
                                               bool populateSandboxCache);
   TSYResult<void> add(const TSYMetadata& metadata, const TSYURL& url, bool transient,
                       bool updateSandbox);
+  // With `onlyIf` another container that has taken the identifier's place meanwhile stays.
   TSYResult<void> remove(const TSYUserIdentityRef& userIdentity, TSYContainerClass contentClass,
-                         const std::string& identifier, bool transient);
+                         const std::string& identifier, bool transient,
+                         const TSYMetadataRef& onlyIf);
 
   TSYUserIdentityCache& userIdentityCache_;
   TSYCodeSigningMapping& codeSigningMapping_;

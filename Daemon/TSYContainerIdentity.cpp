@@ -73,6 +73,10 @@ bool TSYContainerIdentity::isEqualToContainerIdentity(const TSYContainerIdentity
          userIdentity_->isEqualToUserIdentity(*other.userIdentity_);
 }
 
+bool TSYContainerIdentity::isEqual(const TSYContainerIdentity& other) const {
+  return isEqualToContainerIdentity(other);
+}
+
 size_t TSYContainerIdentity::hash() const {
   return hashOf(identifier_) ^ hashOf(userIdentity_->identifier()) ^
          static_cast<size_t>(containerClass_);
@@ -104,6 +108,11 @@ TSYResult<TSYConcreteContainerIdentity> TSYConcreteContainerIdentity::containerI
 bool TSYConcreteContainerIdentity::isEqualToConcreteContainerIdentity(
     const TSYConcreteContainerIdentity& other) const {
   return uuid_ == other.uuid_ && isEqualToContainerIdentity(other);
+}
+
+bool TSYConcreteContainerIdentity::isEqual(const TSYContainerIdentity& other) const {
+  const auto* concrete = dynamic_cast<const TSYConcreteContainerIdentity*>(&other);
+  return concrete != nullptr && isEqualToConcreteContainerIdentity(*concrete);
 }
 
 size_t TSYConcreteContainerIdentity::hash() const {

@@ -36,6 +36,8 @@ class TSYContainerIdentity {
 
   // Compares the three fields; accepts a concrete identity too.
   bool isEqualToContainerIdentity(const TSYContainerIdentity& other) const;
+  // A plain identity may equal a concrete one, a concrete one equals only concrete ones.
+  virtual bool isEqual(const TSYContainerIdentity& other) const;
   virtual size_t hash() const;
   virtual std::string description() const;
 
@@ -60,6 +62,7 @@ class TSYConcreteContainerIdentity : public TSYContainerIdentity {
 
   // Compares all four fields.
   bool isEqualToConcreteContainerIdentity(const TSYConcreteContainerIdentity& other) const;
+  bool isEqual(const TSYContainerIdentity& other) const override;
   size_t hash() const override;
   std::string description() const override;
 

@@ -13,6 +13,7 @@
 
 #include "Daemon/TSYFileManager.h"
 #include "Daemon/TSYLog.h"
+#include "Daemon/TSYPropertyList.h"
 #include "Platform/os/Platform.h"
 
 namespace {
@@ -167,8 +168,7 @@ std::optional<TSYURL> TSYFileManager::realPathForURL(const TSYURL& suspicious,
                 suspicious.path(), base.path());
     return std::nullopt;
   }
-  const auto components = componentsOf(suspiciousText);
-  if (std::ranges::find(components, "..") != components.end()) {
+  if (containsDotDotPathComponents(suspiciousText)) {
     TSYLogWrite(TSYLogLevelError, "The suspicious path {} contains '..' paths, which are invalid",
                 suspicious.path());
     return std::nullopt;

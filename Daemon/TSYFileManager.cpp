@@ -70,8 +70,10 @@ class Obstacles {
   // Takes the flag away from the item, or from the directory that holds it fast: both block. The
   // directory that holds the whole tree is none of it and keeps its flag.
   bool makeRemovable(int parent, const std::string& name, const std::string& path) const {
-    if (clearImmutable(parent, name, path)) return true;
-    return path != rootPath_ && clearImmutable(parent, ".", path.substr(0, path.rfind('/')));
+    const bool item = clearImmutable(parent, name, path);
+    const bool holder =
+        path != rootPath_ && clearImmutable(parent, ".", path.substr(0, path.rfind('/')));
+    return item || holder;
   }
 
   static bool clearImmutable(int parent, const std::string& name, const std::string& path) {

@@ -1,7 +1,6 @@
 // The reader of metadata files. Its checks run in a fixed order and the first that fails ends the
 // read; whoever called decides what such a directory is. A scan runs it for every container of a
 // class, so it copies nothing that it can move.
-
 #include "Daemon/TSYLog.h"
 #include "Daemon/TSYMetadata.h"
 #include "Daemon/TSYMetadataKeys.h"
@@ -166,6 +165,7 @@ class MetadataReader {
     TSYMetadata metadata(*identity, std::move(info_), fileURL_.deletingLastPathComponent(),
                          std::move(assetsName_));
     if (TSYLogIsEnabled(TSYLogLevelDebug)) {
+      if (metadata.info()) dictionary_.insert_or_assign(kTSYMetadataInfo, *metadata.info());
       TSYLogWrite(TSYLogLevelDebug, "[{}] Read metadata from [{}]: {} <= {}",
                   "readAndValidateMetadataAtFileUrl:forUserIdentity:checkClassPath:error:",
                   fileURL_.path(), metadata.description(), Value(dictionary_).description());

@@ -61,7 +61,7 @@ TSYResult<void> TSYMetadata::writeMetadataToFileURL(const TSYURL& fileURL) const
   if (!staging) {
     return TSYFailure(TSYErrorCreate(TSYErrorWriteFailed, std::nullopt, TSYLogIt::yes,
                                      "Failed to write metadata dictionary to URL {} : {}:{}",
-                                     fileURL.path(), TSYPosixErrorDomain, ENOENT));
+                                     "(null)", TSYPosixErrorDomain, ENOENT));
   }
   const TSYURL temporary =
       staging->appending(fmt::format("temp_metadata-{}.plist", uuid_.string()));

@@ -40,7 +40,7 @@ TSYResult<Value::Dictionary> TSY_dictionaryWithContentsOfURL(const TSYURL& url) 
   }
   auto value = platform::readPropertyList(*bytes);
   if (!value) {
-    return TSYFailure(TSYPosixErrorCreate(platform::Errno{EILSEQ}, "{} is no property list: {}",
+    return TSYFailure(TSYPosixErrorCreate(platform::Errno{EBADMSG}, "{} is no property list: {}",
                                           url.path(), value.error().reason));
   }
   Value::Dictionary* dictionary = value->asDictionary();

@@ -54,7 +54,7 @@ TSYUserIdentitySharedCache& TSYUserIdentitySharedCache::sharedInstance() {
 }
 
 TSYUserIdentityRef TSYUserIdentityCache::defaultUserIdentity() {
-  static const TSYUserIdentityRef identity = makeDefaultUserIdentity();
+  static const TSYUserIdentityRef& identity = *new TSYUserIdentityRef(makeDefaultUserIdentity());
   return identity;
 }
 

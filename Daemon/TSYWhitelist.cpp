@@ -67,7 +67,8 @@ TSYWhitelist builtIn() {
 }  // namespace
 
 const TSYWhitelist& TSYWhitelist::sharedWhitelist() {
-  static const TSYWhitelist whitelist = builtIn();
+  // Never destroyed: threads may still ask while the process ends.
+  static const TSYWhitelist& whitelist = *new TSYWhitelist(builtIn());
   return whitelist;
 }
 

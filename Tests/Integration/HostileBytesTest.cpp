@@ -48,8 +48,8 @@ Bytes frame(const Message& message, uint32_t sequence = 1) {
 Bytes framed(const std::string& body, uint32_t flags = 0) {
   const auto header = platform::ipc::encodeHeader(
       {.bodyLength = static_cast<uint32_t>(body.size()), .sequence = 1, .flags = flags});
-  Bytes bytes(header.begin(), header.end());
-  bytes.insert(bytes.end(), body.begin(), body.end());
+  Bytes bytes(header.size() + body.size());
+  std::copy(body.begin(), body.end(), std::copy(header.begin(), header.end(), bytes.begin()));
   return bytes;
 }
 
