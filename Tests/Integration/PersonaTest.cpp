@@ -140,7 +140,7 @@ TEST_F(Personas, AContainerLiesInTheHomeOfItsPersona) {
       {"elsewhere, two personas'", "S", "com.example.both", 2, kSecond, "S"},
       {"at home, the work's", "P", "com.example.work", 2, kHome, "P"},
       {"in the universal persona", "U", "com.example.second", 2, kSecond, "S"},
-      {"a bundle, which is nobody's", std::nullopt, "com.example.work", 1, kGlobal, std::nullopt},
+      {"a bundle, which is nobody's", std::nullopt, "com.example.work", 1, kGlobal, ""},
   };
   std::map<std::string, std::string> uuids;
   for (const auto& one : kCases) {
