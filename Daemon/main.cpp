@@ -24,7 +24,7 @@ int main(int argc, char** argv) {
     return EXIT_FAILURE;
   }
   // The daemon's shared instances use the platform until the process is gone.
-  platform::DevicePlatform* const keptForever = device->release();
+  static platform::DevicePlatform* const keptForever = device->release();
   platform::Platform::setCurrent(keptForever->platform());
   return TSYRunDaemon();
 }

@@ -13,6 +13,7 @@
 
 #include <algorithm>
 #include <array>
+#include <exception>
 #include <filesystem>
 #include <map>
 #include <optional>
@@ -199,6 +200,20 @@ class Tracer {
     if (!threads_.empty()) detach();
   }
 
+  // The kernel lets the last thread, the process's own, end when all others have been waited for.
+  void kill() {
+    threads_.merge(threadsOf(process_));
+    ::kill(process_, SIGKILL);
+    for (const pid_t thread : threads_) {
+      int status = 0;
+      while (thread != process_ && ::waitpid(thread, &status, __WALL) == thread &&
+             WIFSTOPPED(status)) {
+      }
+    }
+    threads_.clear();
+    isDone_ = true;
+  }
+
   std::vector<FileCall> takeCalls() { return std::move(calls_); }
 
  private:
@@ -276,20 +291,6 @@ class Tracer {
     verdict_ = {};
   }
 
-  // The kernel lets the last thread, the process's own, end when all others have been waited for.
-  void kill() {
-    threads_.merge(threadsOf(process_));
-    ::kill(process_, SIGKILL);
-    for (const pid_t thread : threads_) {
-      int status = 0;
-      while (thread != process_ && ::waitpid(thread, &status, __WALL) == thread &&
-             WIFSTOPPED(status)) {
-      }
-    }
-    threads_.clear();
-    isDone_ = true;
-  }
-
   void detach() {
     for (const pid_t thread : threads_) ::ptrace(PTRACE_INTERRUPT, thread, 0, 0);
     while (!threads_.empty()) {
@@ -330,7 +331,15 @@ std::vector<FileCall> traceRequest(pid_t process, const std::function<void()>& r
   Tracer tracer(process, judge);
   tracer.attach();
   std::thread client(request);
-  tracer.run();
+  std::exception_ptr failure;
+  try {
+    tracer.run();
+  } catch (...) {
+    // The judge's. Only a dead daemon is sure to let the client go.
+    failure = std::current_exception();
+    tracer.kill();
+  }
   client.join();
+  if (failure) std::rethrow_exception(failure);
   return tracer.takeCalls();
 }
