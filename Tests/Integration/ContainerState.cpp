@@ -128,6 +128,17 @@ std::string defectOf(const Creation& creation, const std::string& path,
   return metadataDefect(creation, path + kMetadataFile);
 }
 
+void startAndCleanUp(Device& device) {
+  const std::string counter =
+      device.path("/run/tessary/notifications/com.veltra.tessary.cleanup-complete");
+  std::filesystem::remove(counter);
+  device.start();
+  const auto deadline = std::chrono::steady_clock::now() + kPatience;
+  while (!std::filesystem::exists(counter) && std::chrono::steady_clock::now() < deadline) {
+    std::this_thread::sleep_for(std::chrono::milliseconds(1));
+  }
+}
+
 std::string litterThatStays(const Device& device, const Creation& creation,
                             const std::string& passedOver) {
   const auto deadline = std::chrono::steady_clock::now() + kPatience;

@@ -39,7 +39,10 @@ std::map<std::string, std::string> pictureOf(const std::string& container);
 std::string defectOf(const Creation& creation, const std::string& path,
                      const std::map<std::string, std::string>& model);
 
+// Starts the daemon and waits until it has thrown away what the one before left behind.
+void startAndCleanUp(Device& device);
+
 // Waits until staging and death row are empty; what is still there after some seconds, empty when
 // nothing is. `passedOver` begins the names of items in staging that may stay.
 std::string litterThatStays(const Device& device, const Creation& creation,
-                    const std::string& passedOver = "(none)");
+                            const std::string& passedOver = "(none)");

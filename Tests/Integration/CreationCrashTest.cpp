@@ -4,20 +4,14 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
-#include <chrono>
 #include <filesystem>
 #include <fstream>
-#include <thread>
 
 #include "Tests/Integration/ContainerState.h"
 #include "Tests/Integration/SanitizedBuild.h"
 #include "Tests/Integration/SystemCalls.h"
 
 namespace {
-
-// Counts the starts whose clean-up has ended.
-constexpr char kCleanUpComplete[] =
-    "/run/tessary/notifications/com.veltra.tessary.cleanup-complete";
 
 struct Operation {
   const char* name;
@@ -69,14 +63,8 @@ class CreationCrash : public ::testing::TestWithParam<Operation> {
     std::filesystem::remove_all(device_->path("/private/var/containers"));
     std::filesystem::remove_all(device_->path("/private/var/root/Library/Caches"));
     std::filesystem::remove(device_->path("/run/tessary/sandbox/mappings"));
-    std::filesystem::remove(device_->path(kCleanUpComplete));
-    device_->start();
     // The emptying of death row at the start would make some creations longer than others.
-    const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(20);
-    while (!std::filesystem::exists(device_->path(kCleanUpComplete)) &&
-           std::chrono::steady_clock::now() < deadline) {
-      std::this_thread::sleep_for(std::chrono::milliseconds(1));
-    }
+    startAndCleanUp(*device_);
     if (!operation().hasPredecessor) return;
     tessary::Client client = connect();
     EXPECT_TRUE(predecessor().request(client).has_value());

@@ -101,7 +101,7 @@ class CreationFault : public ::testing::Test {
 
   void start() {
     device_->kill();
-    device_->start();
+    startAndCleanUp(*device_);
     client_.emplace(device_->connect(privilegedCaller()));
     ASSERT_TRUE(client_->personaList().has_value());
   }
