@@ -22,7 +22,6 @@
 
 using platform::Platform;
 using platform::UUID;
-using platform::Value;
 
 namespace {
 
@@ -242,7 +241,7 @@ TSYResult<TSYMetadataRef> TSYClientConnection::enterIntoCache(TSYMetadata metada
     (void)TSYFileManager::defaultManager().fastDiskUsageForURL(liveURL);
   }
   metadata.setURL(liveURL);
-  metadata.setExisted(false);
+  metadata.setExisted(/*existed=*/false);
   metadata.setTransient(transient);
   const auto added = TSYContainerCache::sharedInstance().addContainerMetadata(
       metadata, liveURL, transient, /*updateSandbox=*/true);

@@ -182,7 +182,7 @@ TSYResult<TSYContainerCache::ClassCache> TSYContainerCache::_lock_scan(
     if (!metadata) continue;
     metadata->setURL(cache.directory, std::string(item.lastPathComponent()));
     metadata->setTransient(transient);
-    metadata->setExisted(true);
+    metadata->setExisted(/*existed=*/true);
     cache.store(std::make_shared<const TSYMetadata>(std::move(*metadata)));
   }
   return cache;
@@ -340,7 +340,7 @@ TSYResult<void> TSYContainerCache::add(const TSYMetadata& metadata, const TSYURL
       entry.setURL(url);
     }
     entry.setTransient(transient);
-    entry.setExisted(true);
+    entry.setExisted(/*existed=*/true);
     (*cache)->store(std::make_shared<const TSYMetadata>(std::move(entry)));
     shouldRegister = updateSandbox &&
                      shouldRegisterSandboxMappingWithUserIdentity(

@@ -29,7 +29,7 @@ class [[nodiscard]] Result : public std::expected<T, Errno> {
  public:
   using std::expected<T, Errno>::expected;
   // Written out because GCC 12 takes the inherited one to leave something uninitialised.
-  constexpr Result() {}
+  constexpr Result() {}  // NOLINT(modernize-use-equals-default)
 };
 
 }  // namespace platform

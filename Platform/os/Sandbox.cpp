@@ -82,7 +82,7 @@ struct Sandbox::State {
   }
 
   Result<void> open() REQUIRES(mutex);
-  Result<void> compact(int log) REQUIRES(mutex);
+  Result<void> compact(int descriptor) REQUIRES(mutex);
   Result<void> append(const std::string& lines) REQUIRES(mutex);
   int push(const Hash& key, Push push, Batch::Pending* batch);
   void commit(Batch::Pending& batch);

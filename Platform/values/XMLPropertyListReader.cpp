@@ -147,7 +147,7 @@ bool Reader::parse(std::string_view text) {
 
 // The root value: the one child of <plist>, or the document's own element.
 bool Reader::findRoot(pugi::xml_node& root) {
-  if (!onlyElement(document_, root)) return false;
+  if (!onlyElement(document_.root(), root)) return false;
   return std::string_view(root.name()) != "plist" || onlyElement(root, root);
 }
 

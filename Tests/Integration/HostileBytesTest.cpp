@@ -23,7 +23,6 @@
 
 namespace fs = std::filesystem;
 using platform::FileDescriptor;
-using platform::Value;
 using platform::ipc::Message;
 using Bytes = std::vector<uint8_t>;
 using namespace std::chrono_literals;
