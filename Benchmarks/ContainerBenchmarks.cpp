@@ -124,9 +124,12 @@ std::string populate(const ScratchDevice& device) {
   return directory;
 }
 
+struct CloseDirectory {
+  void operator()(DIR* directory) const { ::closedir(directory); }
+};
+
 void scanBare(const std::string& directory) {
-  const std::unique_ptr<DIR, decltype(&::closedir)> items(::opendir(directory.c_str()),
-                                                          &::closedir);
+  const std::unique_ptr<DIR, CloseDirectory> items(::opendir(directory.c_str()));
   check(items != nullptr, "opendir");
   std::array<char, 4096> buffer{};
   while (const dirent* item = ::readdir(items.get())) {

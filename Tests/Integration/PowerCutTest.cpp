@@ -9,12 +9,16 @@
 #include <gtest/gtest.h>
 #include <sys/ioctl.h>
 #include <sys/mount.h>
+#include <sys/stat.h>
+#include <sys/sysmacros.h>
 #include <unistd.h>
 
+#include <chrono>
 #include <filesystem>
 #include <fstream>
 #include <random>
 #include <set>
+#include <thread>
 
 #include "Platform/base/FileDescriptor.h"
 #include "Tests/Integration/ContainerState.h"
@@ -57,8 +61,21 @@ class Disk {
   std::string mountPoint() const { return directory_ + "/mount"; }
 
   void mount() { run({"/usr/bin/mount", "-o", "loop", image(), mountPoint()}); }
-  // Also gives the loop device back.
-  bool unmount() { return ::umount2(mountPoint().c_str(), UMOUNT_NOFOLLOW) == 0; }
+  // Also gives the loop device back, and waits for that: somebody who has just made a mount
+  // namespace of his own has a copy of the mount, and the file system goes on while he is there.
+  bool unmount() {
+    struct stat status{};
+    if (::stat(mountPoint().c_str(), &status) != 0) return false;
+    const std::string backing = fmt::format("/sys/dev/block/{}:{}/loop/backing_file",
+                                            major(status.st_dev), minor(status.st_dev));
+    if (::umount2(mountPoint().c_str(), UMOUNT_NOFOLLOW) != 0) return false;
+    const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(20);
+    while (std::filesystem::exists(backing)) {
+      if (std::chrono::steady_clock::now() > deadline) return false;
+      std::this_thread::sleep_for(std::chrono::milliseconds(1));
+    }
+    return true;
+  }
 
   platform::FileDescriptor open() const {
     return platform::FileDescriptor(
