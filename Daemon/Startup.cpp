@@ -22,7 +22,7 @@ constexpr uint64_t kBootSignpost = 0xEEEEB0B5B2B2EEEE;
 constexpr TSYLogRotation kLogRotation{.files = 1, .bytesPerFile = 102'400};
 constexpr TSYLogRotation kInternalLogRotation{.files = 4, .bytesPerFile = 262'144};
 // The id of the interval "StartingUp".
-const char startingUp = 0;
+const char kStartingUp = 0;
 
 // What cannot be done without ends the process; the service manager sees it fail.
 [[noreturn]] void stopProcess(std::string_view reason) {
@@ -81,17 +81,18 @@ void postAtStartup(const char* name, const char* shortName) {
                     status);
 }
 
-void set_first_boot_work_completed() {
+void setFirstBootWorkCompleted() {
   const auto created =
       Platform::current().semaphores.create(kFirstBootMarker, kFirstBootMarkerMode);
   if (created || created.error().value == EEXIST) return;
-  TSYLogWrite(TSYLogLevelError, "Failed to create semaphore {}: {}", kFirstBootMarker,
-              created.error().message());
+  TSYLogWriteText(TSYLogLevelError, "set_first_boot_work_completed",
+                  fmt::format("Failed to create semaphore {}: {}", kFirstBootMarker,
+                              created.error().message()));
 }
 
 void firstBootDidComplete() {
   TSYLogWrite(TSYLogLevelNotice, "tessaryd first boot cleanup complete");
-  set_first_boot_work_completed();
+  setFirstBootWorkCompleted();
   postAtStartup(platform::notification::kRebootCleanupComplete, "reboot-cleanup-complete");
   TSY_SIGNPOST_END(FirstBootCleanup, kBootSignpost, 0);
 }
@@ -116,7 +117,7 @@ void followLockState() {
 }  // namespace
 
 void TSYInitialiseDaemon() {
-  TSY_SIGNPOST_BEGIN(StartingUp, &startingUp, 0);
+  TSY_SIGNPOST_BEGIN(StartingUp, &kStartingUp, 0);
   openLog();
   logMissingRights();
   createSharedQueues();
@@ -133,5 +134,5 @@ void TSYInitialiseDaemon() {
   TSY_SIGNPOST_BEGIN(BootCleanup, kBootSignpost, 0);
   connection.tessaryCleanupWithCompletion([](uint64_t /*code*/) { bootDidComplete(); });
   logSeparateFileSystems();
-  TSY_SIGNPOST_END(StartingUp, &startingUp, 0);
+  TSY_SIGNPOST_END(StartingUp, &kStartingUp, 0);
 }

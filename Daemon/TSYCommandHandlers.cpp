@@ -62,7 +62,7 @@ uint64_t TSYHandleSystemContainerPath(TSYRelayEvent& event, TSYClientConnection&
   if (!identifier) return TSYErrorMissingIdentifier;
   if (*identifier != connection.clientBundleIdentifier() && !connection.allowOtherIdLookup() &&
       TSYWhitelist::sharedWhitelist().systemContainerIdIsWellknown(*identifier)) {
-    connection.setAllowOtherIdLookup(true);
+    connection.setAllowOtherIdLookup(/*allow=*/true);
   }
   auto userIdentity =
       TSYResolveUserIdentityForIdentifier(connection, *identifier, kTSYContainerClassSystemData);

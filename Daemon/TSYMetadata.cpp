@@ -6,7 +6,6 @@
 #include "Daemon/TSYMetadataKeys.h"
 #include "Daemon/TSYPropertyList.h"
 
-using platform::UUID;
 using platform::Value;
 
 TSYMetadata::TSYMetadata(const TSYConcreteContainerIdentity& identity, Info info, const TSYURL& url,

@@ -59,10 +59,10 @@ Layout layoutFromValue(const Value& value) {
 }
 
 std::optional<uint64_t> classFromKey(const std::string& key) {
-  uint64_t class_ = 0;
-  const auto parsed = std::from_chars(key.data(), key.data() + key.size(), class_);
+  uint64_t containerClass = 0;
+  const auto parsed = std::from_chars(key.data(), key.data() + key.size(), containerClass);
   if (parsed.ec != std::errc() || parsed.ptr != key.data() + key.size()) return std::nullopt;
-  return class_;
+  return containerClass;
 }
 
 }  // namespace
@@ -70,20 +70,20 @@ std::optional<uint64_t> classFromKey(const std::string& key) {
 ContainerLayout::ContainerLayout(const FileSystem& files) : layouts_(ownTable()) {
   const std::string path = configurationDirectory(files) + "/container-layout.plist";
   for (const auto& [key, value] : readConfigurationDictionary(files, path)) {
-    const auto class_ = classFromKey(key);
+    const auto containerClass = classFromKey(key);
     const Layout layout = layoutFromValue(value);
-    if (!class_ || !layout) {
+    if (!containerClass || !layout) {
       platformLog(LogLevel::error, "ContainerLayout::ContainerLayout",
                   "{}: \"{}\" is not a class number with an array of relative paths: {}", path, key,
                   value.description());
     }
-    if (class_) layouts_.insert_or_assign(*class_, layout);
+    if (containerClass) layouts_.insert_or_assign(*containerClass, layout);
   }
 }
 
 std::expected<std::vector<std::string>, uint64_t> ContainerLayout::subdirectoriesOfClass(
-    uint64_t class_) const {
-  const auto found = layouts_.find(class_);
+    uint64_t containerClass) const {
+  const auto found = layouts_.find(containerClass);
   if (found == layouts_.end()) return std::unexpected(kUnknownClass);
   return found->second;
 }

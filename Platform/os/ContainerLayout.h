@@ -23,7 +23,8 @@ class ContainerLayout {
   explicit ContainerLayout(const FileSystem& files);
 
   // Relative paths, parents before their children.
-  std::expected<std::vector<std::string>, uint64_t> subdirectoriesOfClass(uint64_t class_) const;
+  std::expected<std::vector<std::string>, uint64_t> subdirectoriesOfClass(
+      uint64_t containerClass) const;
 
  private:
   std::map<uint64_t, std::expected<std::vector<std::string>, uint64_t>> layouts_;

@@ -80,6 +80,7 @@ platform::Result<void> writeRecord(const platform::FileSystem& files, const Task
 
 int execute(const std::vector<std::string>& command) {
   std::vector<char*> arguments;
+  arguments.reserve(command.size() + 1);
   for (const std::string& argument : command) {
     arguments.push_back(const_cast<char*>(argument.c_str()));
   }
