@@ -61,7 +61,7 @@ FileDescriptor ServiceManager::takeSocket(const std::string& name) const {
                   "what was handed over as {} is no listening socket", name);
     }
   }
-  ::free(names);
+  ::free(static_cast<void*>(names));
   return socket;
 }
 

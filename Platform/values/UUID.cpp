@@ -12,18 +12,18 @@ constexpr bool hyphenBefore(size_t index) {
   return index == 4 || index == 6 || index == 8 || index == 10;
 }
 
-constexpr std::array<int8_t, 256> makeDigitValues() {
-  std::array<int8_t, 256> values{};
+constexpr std::array<int, 256> makeDigitValues() {
+  std::array<int, 256> values{};
   values.fill(-1);
-  for (size_t digit = 0; digit < 10; ++digit) values['0' + digit] = static_cast<int8_t>(digit);
+  for (size_t digit = 0; digit < 10; ++digit) values['0' + digit] = static_cast<int>(digit);
   for (size_t digit = 10; digit < 16; ++digit) {
-    values['A' + digit - 10] = static_cast<int8_t>(digit);
-    values['a' + digit - 10] = static_cast<int8_t>(digit);
+    values['A' + digit - 10] = static_cast<int>(digit);
+    values['a' + digit - 10] = static_cast<int>(digit);
   }
   return values;
 }
 
-constexpr std::array<int8_t, 256> kDigitValues = makeDigitValues();
+constexpr std::array<int, 256> kDigitValues = makeDigitValues();
 
 }  // namespace
 
