@@ -145,6 +145,10 @@ void ScratchDevice::stop() {
   daemon_ = -1;
 }
 
+void ScratchDevice::forgetMappings() const {
+  std::filesystem::remove_all(root_ + "/run/tessary/sandbox");
+}
+
 uint64_t ScratchDevice::daemonMemory() const {
   std::ifstream status(fmt::format("/proc/{}/status", daemon_));
   for (std::string line; std::getline(status, line);) {

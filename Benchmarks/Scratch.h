@@ -23,6 +23,8 @@ class ScratchDevice {
   // Starts the daemon and waits until it answers, and ends it.
   void start();
   void stop();
+  // Makes the sandbox forget the containers that it was told of. Between stop() and start().
+  void forgetMappings() const;
   pid_t daemonPid() const { return daemon_; }
   // Anonymous memory of the daemon that is in use, in bytes.
   uint64_t daemonMemory() const;

@@ -137,8 +137,9 @@ void TSYContainerCache::invalidateUserIdentity(const TSYUserIdentityRef& userIde
   const platform::Sandbox::Batch batch(Platform::current().sandbox);
   for (TSYContainerClass containerClass = 1; containerClass < kTSYContainerClassMax;
        ++containerClass) {
-    const std::string key = cacheKey(userIdentity, containerClass);
-    if (const auto live = liveContainerCache_.find(key); live != liveContainerCache_.end()) {
+    const Key key = _cacheKeyForUserIdentity(userIdentity, containerClass);
+    auto& liveCaches = liveContainerCache_.at(containerClass);
+    if (const auto live = liveCaches.find(key.user); live != liveCaches.end()) {
       for (const TSYMetadataRef& container : live->second.containers) {
         if (!setSandboxContainerMappingForUserIdentity(
                 container->userIdentity(), container->identifier(), containerClass, std::nullopt)) {
@@ -146,9 +147,12 @@ void TSYContainerCache::invalidateUserIdentity(const TSYUserIdentityRef& userIde
                       container->identifier(), containerClass);
         }
       }
-      liveContainerCache_.erase(live);
+      liveCaches.erase(live);
     }
-    transientContainerCache_.erase(key);
+    auto& transientCaches = transientContainerCache_.at(containerClass);
+    if (const auto found = transientCaches.find(key.user); found != transientCaches.end()) {
+      transientCaches.erase(found);
+    }
   }
   const uint32_t status =
       Platform::current().notifications.post(platform::notification::kUserInvalidated);

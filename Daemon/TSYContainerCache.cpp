@@ -27,12 +27,12 @@ const char* mark(bool transient) {
 // Whether a metadata file is not there any more. What cannot be told for now is no reason to forget
 // a container.
 bool hasGone(const TSYURL& file) {
-  const auto status = platform::Platform::current().files.status(file.path());
-  if (status) return false;
-  const int error = status.error().value;
+  const auto exists = platform::Platform::current().files.exists(file.path());
+  if (exists) return false;
+  const int error = exists.error().value;
   if (error == ENOENT || error == ENOTDIR || error == ELOOP) return true;
   TSYLogWrite(TSYLogLevelError, "Failed to determine if {} exists: {}", file.path(),
-              status.error().message());
+              exists.error().message());
   return false;
 }
 
@@ -44,8 +44,8 @@ bool isOutOfResources(const TSYError& error) {
                         underlying->isPosix(ENOMEM));
 }
 
-std::string identifierOf(const TSYUserIdentityRef& userIdentity) {
-  return userIdentity ? userIdentity->identifier() : std::string();
+std::string_view identifierOf(const TSYUserIdentityRef& userIdentity) {
+  return userIdentity ? std::string_view(userIdentity->identifier()) : std::string_view();
 }
 
 }  // namespace
@@ -74,8 +74,10 @@ TSYMetadataRef TSYContainerCache::ClassCache::find(const std::string& identifier
 }
 
 void TSYContainerCache::ClassCache::store(TSYMetadataRef metadata) {
+  const auto [place, isNew] = containers.insert(metadata);
+  if (isNew) return;
   // The one that is there is equal by identifier: it has to go for the new one to come in.
-  containers.erase(metadata);
+  containers.erase(place);
   containers.insert(std::move(metadata));
 }
 
@@ -95,17 +97,21 @@ TSYContainerCache::~TSYContainerCache() {
   userIdentityCache_.removeObserver(*this);
 }
 
-std::string TSYContainerCache::cacheKey(const TSYUserIdentityRef& userIdentity,
-                                        TSYContainerClass containerClass) {
-  const std::string_view key = TSYContainerClassKey(containerClass);
+TSYContainerCache::Key TSYContainerCache::_cacheKeyForUserIdentity(
+    const TSYUserIdentityRef& userIdentity, TSYContainerClass containerClass) {
   if (!TSYUserIdentity::isUserIdentityRequiredForContainerClass(containerClass)) {
-    return std::string(key);
+    return {.user = {}, .containerClass = containerClass};
   }
-  std::string text = "[";
-  text += identifierOf(userIdentity);
-  text += "]-";
-  text += key;
-  return text;
+  return {.user = identifierOf(userIdentity), .containerClass = containerClass};
+}
+
+fmt::format_context::iterator fmt::formatter<TSYContainerCache::Key>::format(
+    const TSYContainerCache::Key& key, format_context& context) const {
+  const std::string_view name = TSYContainerClassKey(key.containerClass);
+  if (!TSYUserIdentity::isUserIdentityRequiredForContainerClass(key.containerClass)) {
+    return fmt::format_to(context.out(), "{}", name);
+  }
+  return fmt::format_to(context.out(), "[{}]-{}", key.user, name);
 }
 
 bool TSYContainerCache::containerURLIsValidForContainerClass(const TSYURL& url,
@@ -118,10 +124,11 @@ bool TSYContainerCache::containerURLIsValidForContainerClass(const TSYURL& url,
 TSYResult<TSYContainerCache::ClassCache*> TSYContainerCache::_lock_getCache(
     const TSYUserIdentityRef& userIdentity, TSYContainerClass contentClass, bool transient,
     bool populateSandboxCache) {
-  const std::string key = cacheKey(userIdentity, contentClass);
-  Caches& caches = _lock_caches(transient);
-  if (const auto found = caches.find(key); found != caches.end()) return &found->second;
-  TSYLogWrite(TSYLogLevelDebug, "Rebuilding container class cache: {}{}", key, mark(transient));
+  const Key key = _cacheKeyForUserIdentity(userIdentity, contentClass);
+  auto& caches = _lock_caches(transient).at(contentClass);
+  if (const auto found = caches.find(key.user); found != caches.end()) return &found->second;
+  TSYSystemLogWrite(TSYChannel::cache, platform::LogLevel::debug,
+                    "Rebuilding container class cache: {}{}", key, mark(transient));
   TSY_SIGNPOST_BEGIN(RebuildingCache, this, contentClass);
   auto scanned = _lock_scanWithOnePersonaList(userIdentity, contentClass, transient);
   // Only what becomes an entry is told to the sandbox: an invalidation finds it there.
@@ -135,7 +142,7 @@ TSYResult<TSYContainerCache::ClassCache*> TSYContainerCache::_lock_getCache(
                                      identifierOf(userIdentity), TSYContainerClassKey(contentClass),
                                      mark(transient)));
   }
-  return &caches.emplace(key, std::move(*scanned)).first->second;
+  return &caches.emplace(key.user, std::move(*scanned)).first->second;
 }
 
 // The list may change between the moment a request is given its identity and this one, and again
@@ -151,7 +158,7 @@ TSYResult<TSYContainerCache::ClassCache> TSYContainerCache::_lock_scanWithOnePer
     const auto generation = userIdentityCache_.generationOfListKnowing(*userIdentity);
     if (!generation) {
       return TSYFailure(TSYPosixErrorCreate(platform::Errno{ENOENT}, "the persona of {} has gone",
-                                            cacheKey(userIdentity, contentClass)));
+                                            _cacheKeyForUserIdentity(userIdentity, contentClass)));
     }
     auto scanned = _lock_scan(userIdentity, contentClass, transient);
     if (userIdentityCache_.generationOfListKnowing(*userIdentity) == generation) return scanned;
@@ -165,12 +172,13 @@ TSYResult<TSYContainerCache::ClassCache> TSYContainerCache::_lock_scan(
           userIdentity, contentClass, transient);
   if (!directory) {
     return TSYFailure(TSYPosixErrorCreate(platform::Errno{ENOENT}, "no class directory for {}",
-                                          cacheKey(userIdentity, contentClass)));
+                                          _cacheKeyForUserIdentity(userIdentity, contentClass)));
   }
   auto items = TSYFileManager::defaultManager().urlsForItemsInDirectoryAtURL(*directory);
   if (!items) return TSYFailure(std::move(items.error()));
 
   ClassCache cache{std::make_shared<const std::string>(directory->path()), {}};
+  cache.containers.reserve(items->size());
   for (const TSYURL& item : *items) {
     if (!containerURLIsValidForContainerClass(item, contentClass)) continue;
     auto metadata =
@@ -205,16 +213,17 @@ TSYResult<TSYMetadataRef> TSYContainerCache::lookUp(const TSYContainerIdentity& 
   }
   if (!container) {
     // Lookups may miss: this is no line in the log.
-    return TSYFailure(TSYErrorCreate(TSYErrorNotFound, std::nullopt, TSYLogIt::no,
-                                     "Cache: {}{}: Container Not Found with ID: {}",
-                                     cacheKey(identity.userIdentity(), identity.containerClass()),
-                                     mark(transient), identity.identifier()));
+    return TSYFailure(
+        TSYErrorCreate(TSYErrorNotFound, std::nullopt, TSYLogIt::no,
+                       "Cache: {}{}: Container Not Found with ID: {}",
+                       _cacheKeyForUserIdentity(identity.userIdentity(), identity.containerClass()),
+                       mark(transient), identity.identifier()));
   }
   auto onDisk = checkStillOnDisk({identity.userIdentity(), container}, transient);
   if (!onDisk) return TSYFailure(std::move(onDisk.error()));
   TSYLogWrite(TSYLogLevelDebug, "Cache: {}{}: Found Identifier: {}",
-              cacheKey(identity.userIdentity(), identity.containerClass()), mark(transient),
-              identity.identifier());
+              _cacheKeyForUserIdentity(identity.userIdentity(), identity.containerClass()),
+              mark(transient), identity.identifier());
   return container;
 }
 
@@ -235,11 +244,11 @@ TSYResult<void> TSYContainerCache::checkStillOnDisk(const Found& found, bool tra
   const TSYMetadata& container = *found.container;
   const TSYURL file = container.metadataFileURL();
   if (!hasGone(file)) return {};
-  TSYError inconsistent =
-      TSYErrorCreate(TSYErrorCacheInconsistent, std::nullopt, TSYLogIt::yes,
-                     "Cache: {}{}: INCONSISTENT-No Metadata at: {} for id: {}, class: {}",
-                     cacheKey(found.keyedUnder, container.containerClass()), mark(transient),
-                     file.path(), container.identifier(), container.containerClass());
+  TSYError inconsistent = TSYErrorCreate(
+      TSYErrorCacheInconsistent, std::nullopt, TSYLogIt::yes,
+      "Cache: {}{}: INCONSISTENT-No Metadata at: {} for id: {}, class: {}",
+      _cacheKeyForUserIdentity(found.keyedUnder, container.containerClass()), mark(transient),
+      file.path(), container.identifier(), container.containerClass());
   const auto removed = remove(found.keyedUnder, container.containerClass(), container.identifier(),
                               transient, found.container);
   if (!removed) {
@@ -273,7 +282,7 @@ TSYResult<std::vector<TSYMetadataRef>> TSYContainerCache::list(
   for (Found& found : *collected) {
     if (!checkStillOnDisk(found, transient)) continue;
     TSYLogWrite(TSYLogLevelDebug, "Cache: {}{}: ALL Found Identifier: {}",
-                cacheKey(found.keyedUnder, contentClass), mark(transient),
+                _cacheKeyForUserIdentity(found.keyedUnder, contentClass), mark(transient),
                 found.container->identifier());
     containers.push_back(std::move(found.container));
   }
@@ -285,11 +294,11 @@ std::vector<TSYUserIdentityRef> TSYContainerCache::identitiesToList(
   if (!userIdentity || !userIdentity->isNoSpecificPersona()) return {userIdentity};
   // Identities that share a key would list the same containers twice.
   std::vector<TSYUserIdentityRef> identities;
-  std::set<std::string> keys;
+  std::set<std::string_view> users;
   userIdentityCache_.forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
       [&](const TSYUserIdentityRef& accessible) {
-        if (keys.insert(cacheKey(accessible, contentClass)).second)
-          identities.push_back(accessible);
+        const Key key = _cacheKeyForUserIdentity(accessible, contentClass);
+        if (users.insert(key.user).second) identities.push_back(accessible);
       });
   return identities;
 }
@@ -353,8 +362,8 @@ TSYResult<void> TSYContainerCache::add(const TSYMetadata& metadata, const TSYURL
                 metadata.identifier(), metadata.containerClass());
   }
   TSYLogWrite(TSYLogLevelDebug, "Cache: {}{}: Added Identifier: {}",
-              cacheKey(metadata.userIdentity(), metadata.containerClass()), mark(transient),
-              metadata.identifier());
+              _cacheKeyForUserIdentity(metadata.userIdentity(), metadata.containerClass()),
+              mark(transient), metadata.identifier());
   return {};
 }
 
@@ -396,6 +405,6 @@ TSYResult<void> TSYContainerCache::remove(const TSYUserIdentityRef& userIdentity
                 contentClass);
   }
   TSYLogWrite(TSYLogLevelDebug, "Cache: {}{}: Removed Identifier: {}",
-              cacheKey(userIdentity, contentClass), mark(transient), identifier);
+              _cacheKeyForUserIdentity(userIdentity, contentClass), mark(transient), identifier);
   return {};
 }

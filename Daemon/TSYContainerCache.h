@@ -10,11 +10,13 @@
 // registration decision asks the mapping.
 #pragma once
 
+#include <array>
 #include <cstdint>
 #include <map>
 #include <memory>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <unordered_set>
 #include <vector>
 
@@ -96,11 +98,20 @@ class TSYContainerCache : public TSYUserIdentityCacheObserver {
     TSYMetadataRef find(const std::string& identifier) const;
     void store(TSYMetadataRef metadata);
   };
-  // By cache key. An absent entry has not been scanned; a present one is authoritative.
-  using Caches = std::map<std::string, ClassCache, std::less<>>;
+  // By class, and within it by the user part of the key. An absent entry has not been scanned; a
+  // present one is authoritative.
+  using Caches = std::array<std::map<std::string, ClassCache, std::less<>>, kTSYContainerClassMax>;
 
-  static std::string cacheKey(const TSYUserIdentityRef& userIdentity,
-                              TSYContainerClass containerClass);
+  // The key of a class cache. It refers to the identity, and becomes text only in a message.
+  struct Key {
+    // The identifier of a class's user; empty for classes whose one cache is everybody's.
+    std::string_view user;
+    TSYContainerClass containerClass;
+  };
+  friend struct fmt::formatter<Key>;
+
+  static Key _cacheKeyForUserIdentity(const TSYUserIdentityRef& userIdentity,
+                                      TSYContainerClass containerClass);
   Caches& _lock_caches(bool transient) REQUIRES(cacheLock_) {
     return transient ? transientContainerCache_ : liveContainerCache_;
   }
@@ -145,4 +156,12 @@ class TSYContainerCache : public TSYUserIdentityCacheObserver {
   platform::Mutex cacheLock_;
   Caches liveContainerCache_ GUARDED_BY(cacheLock_);
   Caches transientContainerCache_ GUARDED_BY(cacheLock_);
+};
+
+// "[501]-appData", or "systemData" of a class whose cache is everybody's.
+template <>
+struct fmt::formatter<TSYContainerCache::Key> {
+  constexpr auto parse(format_parse_context& context) { return context.begin(); }
+  auto format(const TSYContainerCache::Key& key, format_context& context) const
+      -> format_context::iterator;
 };

@@ -34,11 +34,11 @@ TSYError creationError(const std::string& path, bool withIntermediateDirectories
 
 // Whether an allowed missing source ends the operation.
 TSYResult<bool> isMissing(const TSYURL& source) {
-  const auto status = files().status(source.path());
-  if (status) return false;
-  if (status.error() == Errno{ENOENT}) return true;
-  return TSYFailure(TSYPosixErrorCreate(status.error(), "stat of {} failed: {}", source.path(),
-                                        status.error().message()));
+  const auto exists = files().exists(source.path());
+  if (exists) return false;
+  if (exists.error() == Errno{ENOENT}) return true;
+  return TSYFailure(TSYPosixErrorCreate(exists.error(), "stat of {} failed: {}", source.path(),
+                                        exists.error().message()));
 }
 
 // The removal of one tree, for the items that resist.
@@ -242,20 +242,20 @@ TSYResult<std::vector<TSYURL>> TSYFileManager::urlsForItemsInDirectoryAtURL(
 }
 
 bool TSYFileManager::itemExistsAtURL(const TSYURL& url) {
-  const auto status = files().status(url.path());
-  if (!status && status.error() != Errno{ENOENT}) {
+  const auto exists = files().exists(url.path());
+  if (!exists && exists.error() != Errno{ENOENT}) {
     TSYLogWrite(TSYLogLevelError, "Failed to determine if {} exists: {}", url.path(),
-                status.error().message());
+                exists.error().message());
   }
-  return status.has_value();
+  return exists.has_value();
 }
 
 bool TSYFileManager::itemDoesNotExistAtURL(const TSYURL& url) {
-  const auto status = files().status(url.path());
-  if (status) return false;
-  if (status.error() == Errno{ENOENT}) return true;
+  const auto exists = files().exists(url.path());
+  if (exists) return false;
+  if (exists.error() == Errno{ENOENT}) return true;
   TSYLogWrite(TSYLogLevelError, "Failed to determine if {} exists: {}", url.path(),
-              status.error().message());
+              exists.error().message());
   return false;
 }
 

@@ -16,6 +16,12 @@ std::string text(const Value* value) {
   return value == nullptr ? "(null)" : value->description();
 }
 
+bool endsInComponents(std::string_view path, std::string_view components) {
+  if (!path.ends_with(components)) return false;
+  path.remove_suffix(components.size());
+  return path.ends_with('/');
+}
+
 class MetadataReader {
  public:
   MetadataReader(const TSYURL& fileURL, const TSYUserIdentityRef& expected, bool checkClassPath,
@@ -148,10 +154,10 @@ class MetadataReader {
   TSYResult<void> checkClassPath() {
     if (!checkClassPath_) return {};
     const TSYURL parent = fileURL_.deletingLastPathComponent().deletingLastPathComponent();
+    const std::string_view directory = TSYContainerClassDirectory(class_);
+    if (endsInComponents(parent.path(), directory)) return {};
     const TSYURL expected =
-        parent.deletingLastPathComponent().deletingLastPathComponent().appending(
-            TSYContainerClassDirectory(class_));
-    if (parent == expected) return {};
+        parent.deletingLastPathComponent().deletingLastPathComponent().appending(directory);
     return invalid("Invalid metadata-URLs should match: {} : {}", fileURL_.path(), expected.path());
   }
 

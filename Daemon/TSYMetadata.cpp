@@ -29,6 +29,15 @@ void TSYMetadata::setURL(std::shared_ptr<const std::string> directory, std::stri
   name_ = std::move(name);
 }
 
+// Both are asked for with every lookup, and are put together in one piece.
+TSYURL TSYMetadata::url() const {
+  return TSYURL(fmt::format("{}/{}", *directory_, name_));
+}
+
+TSYURL TSYMetadata::metadataFileURL() const {
+  return TSYURL(fmt::format("{}/{}/{}", *directory_, name_, kTSYMetadataFileName));
+}
+
 TSYConcreteContainerIdentity TSYMetadata::containerIdentity() const {
   // Cannot fail: the fields came from an identity.
   return *TSYConcreteContainerIdentity::containerIdentityWithUUID(uuid_, userIdentity_, identifier_,

@@ -52,8 +52,8 @@ class TSYMetadata {
   TSYContainerClass containerClass() const { return containerClass_; }
   const std::string& identifier() const { return identifier_; }
   const platform::UUID& uuid() const { return uuid_; }
-  TSYURL url() const { return TSYURL(*directory_).appending(name_); }
-  TSYURL metadataFileURL() const { return url().appending(kTSYMetadataFileName); }
+  TSYURL url() const;
+  TSYURL metadataFileURL() const;
   // May be null.
   const Info& info() const { return info_; }
   const std::optional<std::string>& userManagedAssetsDirName() const { return assetsName_; }

@@ -18,7 +18,9 @@ class TSYURL {
   const std::string& path() const { return path_; }
 
   TSYURL appending(std::string_view relativePath) const {
-    std::string path = path_;
+    std::string path;
+    path.reserve(path_.size() + 1 + relativePath.size());
+    path = path_;
     if (path.empty() || path.back() != '/') path += '/';
     path += relativePath;
     return TSYURL(std::move(path));

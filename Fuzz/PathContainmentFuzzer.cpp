@@ -2,53 +2,28 @@
 // realPathForURL:ifChildOfURL: accepts must lie inside the base when the kernel resolves it.
 //
 // The input is a list of lines. "d PATH" makes a directory, "f PATH" a file, "l PATH TEXT" a link,
-// each below the scratch root; "b PATH" chooses the base; "?TEXT" asks about the base with TEXT
-// behind it.
-#include <fcntl.h>
+// each below the directory "t" of a scratch root; "b PATH" chooses the base; "?TEXT" asks about the
+// base with TEXT behind it.
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <cstdio>
 #include <cstdlib>
-#include <filesystem>
 #include <memory>
 #include <sstream>
 #include <string>
 
 #include "Daemon/TSYFileManager.h"
-#include "Platform/base/FileDescriptor.h"
-#include "Platform/os/Platform.h"
+#include "Fuzz/FuzzDevice.h"
 
 namespace {
 
 constexpr size_t kMostLines = 24;
 constexpr size_t kLongestInput = 2048;
 
-// One device for all inputs; the trees are made in its directory "t" and removed again.
-class Device {
- public:
-  Device() {
-    ::setenv("TESSARY_LOG_LEVEL", "fault", 1);  // every rejection is logged
-    // In memory where that is possible: what takes the time is making the trees.
-    const char* const directory = ::access("/dev/shm", W_OK) == 0 ? "/dev/shm" : "/tmp";
-    std::string name = std::filesystem::canonical(directory).string() + "/containment.XXXXXX";
-    if (::mkdtemp(name.data()) == nullptr) std::abort();
-    root_ = name;
-    auto device = platform::DevicePlatform::open(root_);
-    if (!device) std::abort();
-    device_ = std::move(*device);
-    platform::Platform::setCurrent(device_->platform());
-  }
-  ~Device() { std::filesystem::remove_all(root_); }
-
-  // The path below "t". Nothing is made through a link or outside.
-  std::string path(const std::string& text) const { return root_ + "/t/" + text; }
-  platform::FileSystem& files() const { return device_->platform().files; }
-
- private:
-  std::string root_;
-  std::unique_ptr<platform::DevicePlatform> device_;
-};
+std::string treePath(const FuzzDevice& device, const std::string& text) {
+  return device.root() + "/t/" + text;
+}
 
 std::string kernelPath(const std::string& path) {
   const std::unique_ptr<char, decltype(&std::free)> real(::realpath(path.c_str(), nullptr),
@@ -56,7 +31,7 @@ std::string kernelPath(const std::string& path) {
   return real ? real.get() : "";
 }
 
-void makeLink(const Device& device, const std::string& path, const std::string& text) {
+void makeLink(const FuzzDevice& device, const std::string& path, const std::string& text) {
   const auto place = device.files().locate(path);
   if (!place || text.empty()) return;
   static_cast<void>(::symlinkat(text.c_str(), place->parent.get(), place->name.c_str()));
@@ -79,25 +54,25 @@ void ask(const std::string& base, const std::string& text) {
   std::abort();
 }
 
-void run(const Device& device, const std::string& line, std::string& base) {
+void run(const FuzzDevice& device, const std::string& line, std::string& base) {
   if (line.starts_with('?')) return ask(base, line.substr(1));
   if (line.size() < 3 || line[1] != ' ') return;
   const std::string rest = line.substr(2);
   const size_t space = rest.find(' ');
   switch (line[0]) {
     case 'd':
-      static_cast<void>(device.files().makePath(device.path(rest), 0755));
+      static_cast<void>(device.files().makePath(treePath(device, rest), 0755));
       break;
     case 'f':
-      static_cast<void>(device.files().writeFile(device.path(rest), {}, {}));
+      static_cast<void>(device.files().writeFile(treePath(device, rest), {}, {}));
       break;
     case 'l':
       if (space != std::string::npos) {
-        makeLink(device, device.path(rest.substr(0, space)), rest.substr(space + 1));
+        makeLink(device, treePath(device, rest.substr(0, space)), rest.substr(space + 1));
       }
       break;
     case 'b':
-      base = TSYURL(device.path(rest)).path();
+      base = TSYURL(treePath(device, rest)).path();
       break;
     default:
       break;
@@ -107,15 +82,15 @@ void run(const Device& device, const std::string& line, std::string& base) {
 }  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* bytes, size_t size) {
-  static const Device device;
+  static const FuzzDevice device;
   if (size > kLongestInput) return 0;
-  static_cast<void>(device.files().makePath(device.path("base"), 0755));
-  std::string base = device.path("base");
+  static_cast<void>(device.files().makePath(treePath(device, "base"), 0755));
+  std::string base = treePath(device, "base");
   std::istringstream input(std::string(reinterpret_cast<const char*>(bytes), size));
   std::string line;
   for (size_t lines = 0; lines < kMostLines && std::getline(input, line); ++lines) {
     run(device, line, base);
   }
-  if (!device.files().remove(device.path(""), nullptr)) std::abort();
+  if (!device.files().remove(treePath(device, ""), nullptr)) std::abort();
   return 0;
 }

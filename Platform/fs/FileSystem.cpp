@@ -22,6 +22,7 @@ namespace {
 constexpr int kReadDirectory = O_RDONLY | O_DIRECTORY;
 // A descriptor to work from with the ...at() calls: needs no right to read the directory.
 constexpr int kReachDirectory = O_PATH | O_DIRECTORY;
+constexpr int kReachItem = O_PATH | O_NOFOLLOW;
 constexpr mode_t kPermissionBits = 07777;
 
 struct CloseStream {
@@ -146,8 +147,14 @@ Result<FileDescriptor> FileSystem::openItem(const std::string& path) const {
   return openAt(path, O_RDONLY | O_NONBLOCK | O_NOCTTY);
 }
 
+Result<void> FileSystem::exists(const std::string& path) const {
+  const auto item = openAt(path, kReachItem);
+  if (!item) return failWith(item.error().value);
+  return {};
+}
+
 Result<struct stat> FileSystem::status(const std::string& path) const {
-  const auto item = openAt(path, O_PATH | O_NOFOLLOW);
+  const auto item = openAt(path, kReachItem);
   if (!item) return failWith(item.error().value);
   struct stat status{};
   if (::fstat(item->get(), &status) != 0) return lastErrno();

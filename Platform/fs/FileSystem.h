@@ -72,6 +72,8 @@ class FileSystem {
   Result<FileDescriptor> openDirectory(const std::string& path) const;
   // Opens any existing item for reading, without following a final link and without waiting.
   Result<FileDescriptor> openItem(const std::string& path) const;
+  // Succeeds when something is there, a link that leads nowhere included.
+  Result<void> exists(const std::string& path) const;
   // lstat(2).
   Result<struct stat> status(const std::string& path) const;
   // Every entry but "." and "..", in the order of the directory. ENOTDIR, ENOENT and so on.

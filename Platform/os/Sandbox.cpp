@@ -2,8 +2,9 @@
 // that a push changes nothing. The hashes are SipHash of 128 bits under a key of this process, so
 // that nobody can choose two mappings that collide.
 //
-// A batch keeps the last push of each key back until it ends. The order of pushes holds between
-// threads all the same: a push takes back what another thread's batch still holds for its key.
+// A batch keeps the last push of each key back until it ends, unless it changes nothing. The order
+// of pushes holds between threads all the same: a push takes back what any batch still holds for
+// its key, so that at a commit each push that is left is the last one of its key.
 #include "Platform/os/Sandbox.h"
 
 #include <fcntl.h>
@@ -55,9 +56,21 @@ Hash hashOfMappingKey(const HashKey& key, const SandboxMappingKey& mapping) {
   return hashOf(key, bytes);
 }
 
+// A mapping as a hash of its key and, unless it is to be cleared, of its path.
+struct HashedMapping {
+  Hash key;
+  std::optional<Hash> path;
+};
+
+// A push that has been kept back.
 struct Push {
-  std::optional<Hash> path;  // none: clear
-  std::string line;
+  std::optional<Hash> pathHash;
+  SandboxMapping mapping;
+
+  std::string line() const {
+    return formatMappingLine({mapping.uid, mapping.personaID, mapping.itemType, mapping.identifier},
+                             mapping.path);
+  }
 };
 using Pushes = std::unordered_map<Hash, Push, HashOfHash>;
 
@@ -84,10 +97,11 @@ struct Sandbox::State {
   Result<void> open() REQUIRES(mutex);
   Result<void> compact(int descriptor) REQUIRES(mutex);
   Result<void> append(const std::string& lines) REQUIRES(mutex);
-  int push(const Hash& key, Push push, Batch::Pending* batch);
+  int push(const SandboxMappingKey& key, const std::optional<std::string>& path,
+           Batch::Pending* batch);
   void commit(Batch::Pending& batch);
-  bool changesNothing(const Hash& key, const Push& push) const REQUIRES(mutex);
-  void remember(const Hash& key, const Push& push) REQUIRES(mutex);
+  bool changesNothing(const HashedMapping& mapping) const REQUIRES(mutex);
+  void remember(const HashedMapping& mapping) REQUIRES(mutex);
 
   const FileSystem& files;
   const FileExtensions extensions;
@@ -181,51 +195,54 @@ Result<void> Sandbox::State::append(const std::string& lines) {
   return written;
 }
 
-bool Sandbox::State::changesNothing(const Hash& key, const Push& push) const {
-  const auto known = mappings.find(key);
-  if (known == mappings.end()) return !push.path;
-  return push.path == known->second;
+bool Sandbox::State::changesNothing(const HashedMapping& mapping) const {
+  const auto known = mappings.find(mapping.key);
+  if (known == mappings.end()) return !mapping.path;
+  return mapping.path == known->second;
 }
 
-void Sandbox::State::remember(const Hash& key, const Push& push) {
-  if (push.path) {
-    mappings.insert_or_assign(key, *push.path);
+void Sandbox::State::remember(const HashedMapping& mapping) {
+  if (mapping.path) {
+    mappings.insert_or_assign(mapping.key, *mapping.path);
   } else {
-    mappings.erase(key);
+    mappings.erase(mapping.key);
   }
 }
 
-int Sandbox::State::push(const Hash& key, Push push, Batch::Pending* batch) {
-  if (push.line.size() > kLongestMappingLine) return ENAMETOOLONG;
+int Sandbox::State::push(const SandboxMappingKey& key, const std::optional<std::string>& path,
+                         Batch::Pending* batch) {
+  if (!fitsMappingLine(key, path)) return ENAMETOOLONG;
+  const HashedMapping mapping{hashOfMappingKey(hashKey, key),
+                              path ? std::optional(hashOf(hashKey, *path)) : std::nullopt};
   const MutexLock lock(mutex);
   // Opened first: what the log holds decides whether the push changes anything.
   if (const auto opened = open(); !opened) return opened.error().value;
-  for (Batch::Pending* other : batches) other->pushes.erase(key);
+  for (Batch::Pending* other : batches) other->pushes.erase(mapping.key);
+  if (changesNothing(mapping)) return 0;
   if (batch != nullptr) {
-    batch->pushes.insert_or_assign(key, std::move(push));
+    SandboxMapping copy{key.uid, key.personaID, key.itemType, std::string(key.identifier), path};
+    batch->pushes.emplace(mapping.key, Push{mapping.path, std::move(copy)});
     return 0;
   }
-  if (changesNothing(key, push)) return 0;
-  if (const auto appended = append(push.line); !appended) return appended.error().value;
-  remember(key, push);
+  if (const auto appended = append(formatMappingLine(key, path)); !appended) {
+    return appended.error().value;
+  }
+  remember(mapping);
   return 0;
 }
 
 void Sandbox::State::commit(Batch::Pending& batch) {
   const MutexLock lock(mutex);
   std::erase(batches, &batch);
-  std::erase_if(batch.pushes, [&](const auto& entry) REQUIRES(mutex) {
-    return changesNothing(entry.first, entry.second);
-  });
   if (batch.pushes.empty()) return;
   std::string lines;
-  for (const auto& [key, push] : batch.pushes) lines += push.line;
+  for (const auto& [key, push] : batch.pushes) lines += push.line();
   if (const auto appended = append(lines); !appended) {
     platformLog(LogLevel::error, "Sandbox::commit", "{} mappings are lost: {}", batch.pushes.size(),
                 appended.error().message());
     return;
   }
-  for (const auto& [key, push] : batch.pushes) remember(key, push);
+  for (const auto& [key, push] : batch.pushes) remember({key, push.pathHash});
 }
 
 Sandbox::Sandbox(const FileSystem& files) : state_(std::make_unique<State>(files)) {
@@ -240,12 +257,10 @@ Sandbox::~Sandbox() = default;
 
 int Sandbox::setContainerPath(const SandboxMappingKey& key,
                               const std::optional<std::string>& path) {
-  Push push{std::nullopt, formatMappingLine(key, path)};
-  if (path) push.path = hashOf(state_->hashKey, *path);
   Batch::Pending* const batch = innermostBatch != nullptr && innermostBatch->sandbox == state_.get()
                                     ? innermostBatch
                                     : nullptr;
-  return state_->push(hashOfMappingKey(state_->hashKey, key), std::move(push), batch);
+  return state_->push(key, path, batch);
 }
 
 Sandbox::Batch::Batch(Sandbox& sandbox)

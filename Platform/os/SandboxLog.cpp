@@ -3,8 +3,10 @@
 #include <fmt/format.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <array>
 #include <charconv>
+#include <functional>
 #include <vector>
 
 #include "Platform/os/RuntimeDirectory.h"
@@ -13,15 +15,24 @@
 namespace platform {
 namespace {
 
+bool standsForItself(char c) {
+  const auto byte = static_cast<unsigned char>(c);
+  return byte > 0x20 && byte != 0x7F && c != '%';
+}
+
 void appendEncoded(std::string& line, std::string_view text) {
-  for (const char c : text) {
-    const auto byte = static_cast<unsigned char>(c);
-    if (byte > 0x20 && byte != 0x7F && c != '%') {
-      line += c;
-    } else {
-      fmt::format_to(std::back_inserter(line), "%{:02X}", byte);
-    }
+  while (!text.empty()) {
+    const auto end = std::ranges::find_if_not(text, standsForItself);
+    line.append(text.begin(), end);
+    if (end == text.end()) return;
+    line += fmt::format("%{:02X}", static_cast<unsigned char>(*end));
+    text = {end + 1, text.end()};
   }
+}
+
+size_t encodedSize(std::string_view text) {
+  return text.size() +
+         2 * static_cast<size_t>(std::ranges::count_if(text, std::not_fn(standsForItself)));
 }
 
 template <typename Number>
@@ -60,10 +71,17 @@ std::string sandboxLogPath(const FileSystem& files) {
   return runtimeDirectory(files) + "/sandbox/mappings";
 }
 
+bool fitsMappingLine(const SandboxMappingKey& key, const std::optional<std::string>& path) {
+  constexpr size_t kVerbAndNumbers = 64;  // at most
+  return kVerbAndNumbers + encodedSize(key.identifier) + (path ? encodedSize(*path) : 0) <=
+         kLongestMappingLine;
+}
+
 std::string formatMappingLine(const SandboxMappingKey& key,
                               const std::optional<std::string>& path) {
   std::string line =
       fmt::format("{}\t{}\t{}\t{}\t", path ? "set" : "clear", key.uid, key.personaID, key.itemType);
+  line.reserve(line.size() + key.identifier.size() + (path ? path->size() : 0) + 2);
   appendEncoded(line, key.identifier);
   if (path) {
     line += '\t';

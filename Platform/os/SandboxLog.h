@@ -32,6 +32,8 @@ struct SandboxMapping {
 
 std::string sandboxLogPath(const FileSystem& files);
 
+// Whether the line would not be too long.
+bool fitsMappingLine(const SandboxMappingKey& key, const std::optional<std::string>& path);
 // With the line feed.
 std::string formatMappingLine(const SandboxMappingKey& key, const std::optional<std::string>& path);
 // Without the line feed.

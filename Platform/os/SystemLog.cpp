@@ -59,9 +59,9 @@ void appendEscaped(fmt::memory_buffer& buffer, std::string_view text) {
     if (!isControl(text, i)) {
       buffer.push_back(c);
     } else if (c == '\n') {
-      fmt::format_to(std::back_inserter(buffer), "\\n");
+      fmt::format_to(fmt::appender(buffer), "\\n");
     } else {
-      fmt::format_to(std::back_inserter(buffer), "\\x{:02x}", static_cast<unsigned char>(c));
+      fmt::format_to(fmt::appender(buffer), "\\x{:02x}", static_cast<unsigned char>(c));
     }
   }
 }
@@ -71,7 +71,7 @@ void appendTime(fmt::memory_buffer& buffer) {
   ::clock_gettime(CLOCK_REALTIME, &now);
   tm parts{};
   ::gmtime_r(&now.tv_sec, &parts);
-  fmt::format_to(std::back_inserter(buffer), "{:04}-{:02}-{:02}T{:02}:{:02}:{:02}.{:06}Z",
+  fmt::format_to(fmt::appender(buffer), "{:04}-{:02}-{:02}T{:02}:{:02}:{:02}.{:06}Z",
                  parts.tm_year + 1900, parts.tm_mon + 1, parts.tm_mday, parts.tm_hour, parts.tm_min,
                  parts.tm_sec, now.tv_nsec / 1000);
 }
@@ -80,9 +80,9 @@ void writeToStandardError(LogLevel level, std::string_view category, std::string
                           uint64_t code, std::string_view text) {
   fmt::memory_buffer line;
   appendTime(line);
-  fmt::format_to(std::back_inserter(line), " {} {} {}: ", nameOf(level).name, category, function);
+  fmt::format_to(fmt::appender(line), " {} {} {}: ", nameOf(level).name, category, function);
   appendEscaped(line, text);
-  if (code != 0) fmt::format_to(std::back_inserter(line), " (code {})", code);
+  if (code != 0) fmt::format_to(fmt::appender(line), " (code {})", code);
   line.push_back('\n');
   // A log that nobody can read any more is not worth a failure.
   [[maybe_unused]] const ssize_t count = ::write(STDERR_FILENO, line.data(), line.size());
@@ -95,17 +95,17 @@ void writeToJournal(LogLevel level, std::string_view category, std::string_view 
   std::array<size_t, 6> ends{};
   size_t count = 0;
   const auto endField = [&] { ends[count++] = buffer.size(); };
-  fmt::format_to(std::back_inserter(buffer), "MESSAGE=");
+  fmt::format_to(fmt::appender(buffer), "MESSAGE=");
   appendEscaped(buffer, text);
   endField();
-  fmt::format_to(std::back_inserter(buffer), "PRIORITY={}", nameOf(level).priority);
+  fmt::format_to(fmt::appender(buffer), "PRIORITY={}", nameOf(level).priority);
   endField();
-  fmt::format_to(std::back_inserter(buffer), "TESSARY_CATEGORY={}", category);
+  fmt::format_to(fmt::appender(buffer), "TESSARY_CATEGORY={}", category);
   endField();
-  fmt::format_to(std::back_inserter(buffer), "TESSARY_FUNCTION={}", function);
+  fmt::format_to(fmt::appender(buffer), "TESSARY_FUNCTION={}", function);
   endField();
   if (code != 0) {
-    fmt::format_to(std::back_inserter(buffer), "TESSARY_CODE={}", code);
+    fmt::format_to(fmt::appender(buffer), "TESSARY_CODE={}", code);
     endField();
   }
   std::array<iovec, 6> fields{};

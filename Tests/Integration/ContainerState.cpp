@@ -4,16 +4,14 @@
 #include <sys/stat.h>
 #include <sys/xattr.h>
 
-#include <algorithm>
 #include <array>
-#include <chrono>
 #include <filesystem>
 #include <fstream>
 #include <iterator>
-#include <thread>
 
 #include "Platform/values/PropertyList.h"
 #include "Platform/values/UUID.h"
+#include "Tests/Integration/Subprocess.h"
 
 using platform::UUID;
 using platform::Value;
@@ -24,7 +22,6 @@ constexpr char kMetadataFile[] = "/.com.veltra.tessary.metadata.plist";
 constexpr char kUserContainers[] = "/private/var/mobile/Containers";
 constexpr char kGlobalContainers[] = "/private/var/containers";
 constexpr char kCaches[] = "/private/var/root/Library/Caches/com.veltra.tessaryd";
-constexpr std::chrono::seconds kPatience{20};
 
 std::string attribute(const std::string& path, const char* name) {
   std::array<unsigned char, 256> value{};
@@ -48,11 +45,8 @@ std::string metadataDefect(const Creation& creation, const std::string& file) {
   const std::vector<uint8_t> bytes{std::istreambuf_iterator<char>(stream), {}};
   const auto value = platform::readPropertyList(bytes);
   if (!value || value->asDictionary() == nullptr) return "no property list: " + file;
-  const auto text = [&](const char* key) {
-    const auto found = value->asDictionary()->find(key);
-    return found == value->asDictionary()->end() ? std::string("missing")
-                                                 : found->second.description();
-  };
+  Value::Dictionary entries = *value->asDictionary();
+  const auto text = [&](const char* key) { return entries[key].description(); };
   if (text("TSYMetadataIdentifier") != Value(creation.identifier).description() ||
       text("TSYMetadataContentClass") != Value(creation.containerClass).description() ||
       !UUID::parse(text("TSYMetadataUUID"))) {
@@ -100,12 +94,11 @@ std::vector<std::string> itemsIn(const Device& device, const std::string& direct
   for (const auto& item : std::filesystem::directory_iterator(device.path(directory), missing)) {
     names.push_back(item.path().filename());
   }
-  std::ranges::sort(names);
   return names;
 }
 
-std::map<std::string, std::string> pictureOf(const std::string& container) {
-  std::map<std::string, std::string> picture{{"", lookOf(container)}};
+Picture pictureOf(const std::string& container) {
+  Picture picture{{"", lookOf(container)}};
   std::error_code missing;
   for (const auto& item : std::filesystem::recursive_directory_iterator(container, missing)) {
     const std::string path = item.path();
@@ -114,17 +107,14 @@ std::map<std::string, std::string> pictureOf(const std::string& container) {
   return picture;
 }
 
-std::string defectOf(const Creation& creation, const std::string& path,
-                     const std::map<std::string, std::string>& model) {
-  const auto picture = pictureOf(path);
+std::string defectOf(const Creation& creation, const std::string& path, const Picture& model) {
+  Picture picture = pictureOf(path);
   for (const auto& [name, look] : model) {
-    const auto found = picture.find(name);
-    if (found == picture.end()) return path + ": no " + name;
-    if (found->second != look) {
-      return fmt::format("{}: {} is {} and should be {}", path, name, found->second, look);
-    }
+    const std::string found = picture.contains(name) ? picture.at(name) : "missing";
+    if (found != look) return fmt::format("{}: {} is {} and should be {}", path, name, found, look);
+    picture.erase(name);
   }
-  if (picture.size() != model.size()) return path + ": too much in it";
+  if (!picture.empty()) return path + ": too much in it: " + picture.begin()->first;
   return metadataDefect(creation, path + kMetadataFile);
 }
 
@@ -133,22 +123,19 @@ void startAndCleanUp(Device& device) {
       device.path("/run/tessary/notifications/com.veltra.tessary.cleanup-complete");
   std::filesystem::remove(counter);
   device.start();
-  const auto deadline = std::chrono::steady_clock::now() + kPatience;
-  while (!std::filesystem::exists(counter) && std::chrono::steady_clock::now() < deadline) {
-    std::this_thread::sleep_for(std::chrono::milliseconds(1));
-  }
+  becomes([&] { return std::filesystem::exists(counter); });
 }
 
 std::string litterThatStays(const Device& device, const Creation& creation,
                             const std::string& passedOver) {
-  const auto deadline = std::chrono::steady_clock::now() + kPatience;
-  for (;;) {
-    std::string litter;
+  std::string litter;
+  becomes([&] {
+    litter.clear();
     for (const std::string& name : itemsIn(device, kDeathRow)) litter += " on death row: " + name;
     for (const std::string& name : itemsIn(device, creation.stagingDirectory())) {
       if (!name.starts_with(passedOver)) litter += " in staging: " + name;
     }
-    if (litter.empty() || std::chrono::steady_clock::now() > deadline) return litter;
-    std::this_thread::sleep_for(std::chrono::milliseconds(1));
-  }
+    return litter.empty();
+  });
+  return litter;
 }

@@ -1,5 +1,5 @@
-// Each call to the file system that a creation makes fails once. The answer is the code of the step
-// that it belongs to, what was built is on its way out, and the next request succeeds.
+// Each call to the file system that a creation makes fails. The answer is the code of the step that
+// it belongs to, what was built is on its way out, and the next request succeeds.
 #include <fmt/format.h>
 #include <gtest/gtest.h>
 #include <unistd.h>
@@ -18,28 +18,31 @@
 namespace {
 
 constexpr uint64_t kSuccess = 1;
+constexpr uint64_t kNotCleanedUp = 9;
 constexpr char kTemporaryMetadata[] = "temp_metadata-";
 
 struct Step {
-  const char* name;
   uint64_t code;
+  const char* message;  // in the log
+  bool hasBuilt = false;
 };
-constexpr Step kFinding{"finding", 43};
-constexpr Step kStaging{"staging directory", 7};
-constexpr Step kMetadata{"metadata", 34};
-constexpr Step kList{"access-control list", 63};
-constexpr Step kSubdirectories{"subdirectories", 6};
-constexpr Step kMoving{"move into place", 8};
-constexpr Step kEntering{"entering", kSuccess};
+constexpr Step kFinding{43, ""};
+constexpr Step kStaging{7, "Failed to create staging dir at "};
+constexpr Step kMetadata{34, " metadata ", true};
+constexpr Step kList{63, "Failed to set ACL on ", true};
+constexpr Step kSubdirectories{6, "Failed to create sub-dir for ", true};
+constexpr Step kMoving{8, "Failed to move staging dir: ", true};
+constexpr Step kEntering{kSuccess, ""};
 
 // Follows a creation through its steps by the paths that its calls name. A call without one belongs
 // to what was named last.
 class Progress {
  public:
   void follow(const FileCall& call) {
+    call_ = call;
     if (isMoved_) step_ = &kEntering;
     if (!call.path.empty()) name(call);
-    if (call.name == "renameat" && isUUID(call.path)) isMoved_ = true;
+    if (call.name == "renameat" && platform::UUID::parse(call.path)) isMoved_ = true;
   }
 
   const Step& step() const { return *step_; }
@@ -47,12 +50,12 @@ class Progress {
   // Whether a daemon does this in its first request of a class only.
   bool isFirstUse() const { return step_ == &kFinding || isGroups_; }
 
-  // The codes that a fault of the call may lead to.
-  std::set<uint64_t> codes(const FileCall& call) const {
+  // The codes that a fault of the last call may lead to.
+  std::set<uint64_t> codes() const {
     // A directory of the configuration that cannot be looked after is logged, and used all the
     // same. It may turn out to be missing when the class is read.
     if (step_ == &kFinding) {
-      if (call.name == "getdents64") return {kFinding.code};
+      if (call_.name == "getdents64") return {kFinding.code};
       return {kSuccess, kFinding.code};
     }
     if (isConfiguration_) return {kSuccess};
@@ -62,16 +65,15 @@ class Progress {
   }
 
  private:
-  static bool isUUID(const std::string& name) { return platform::UUID::parse(name).has_value(); }
-
   void name(const FileCall& call) {
     const std::string& path = call.path;
     // Not a name in an open directory, nor the descriptor of one as a path.
     const bool isWhole = path.find('/') != std::string::npos && !path.starts_with('/');
+    const bool isInStaging = path.find("/Staging/") != std::string::npos;
     if (isWhole) isGroups_ = path == "etc/group";
-    if (isWhole) isConfiguration_ = !call.locatesOnly && !isGroups_ && !isInStaging(path);
+    if (isWhole) isConfiguration_ = !call.locatesOnly && !isGroups_ && !isInStaging;
     if (isGroups_) step_ = &kList;
-    if (isWhole && isInStaging(path)) {
+    if (isWhole && isInStaging) {
       const size_t end = path.find('/', path.find("/Staging/") + 9);
       if (step_ == &kFinding) step_ = &kStaging;
       if (end != std::string::npos) step_ = &kSubdirectories;
@@ -80,221 +82,138 @@ class Progress {
     if (isConfiguration_ && step_ == &kSubdirectories) step_ = &kMoving;
   }
 
-  static bool isInStaging(const std::string& path) {
-    return path.find("/Staging/") != std::string::npos;
-  }
-
+  FileCall call_;
   const Step* step_ = &kFinding;
   bool isConfiguration_ = false;
   bool isGroups_ = false;
   bool isMoved_ = false;
 };
 
-class CreationFault : public ::testing::Test {
+class CreationFault : public ::testing::TestWithParam<uint64_t> {
  protected:
   void SetUp() override {
-    if (::geteuid() != 0) GTEST_SKIP() << "needs root";
     if (const std::string why = whyNotTraceable(); !why.empty()) GTEST_SKIP() << why;
     device_.emplace(quickParent());
-    start();
+    startAfresh();
+    learn();
   }
 
-  void start() {
+  // A daemon that has served nothing, on a device without containers.
+  void startAfresh() {
     device_->kill();
+    std::filesystem::remove_all(device_->path("/private/var/mobile/Containers"));
+    std::filesystem::remove_all(device_->path("/private/var/containers"));
     startAndCleanUp(*device_);
     client_.emplace(device_->connect(privilegedCaller()));
-    ASSERT_TRUE(client_->personaList().has_value());
+    live_ = 0;
   }
 
-  // The answer's code: 1 for success.
-  uint64_t create(const Creation& creation, const CallJudge& judge) {
-    uint64_t code = 0;
-    calls_ = traceRequest(
+  Creation newCreation() { return {GetParam(), fmt::format("com.example.app{}", ++creations_)}; }
+
+  std::vector<FileCall> create(const Creation& creation, const CallJudge& judge) {
+    return traceRequest(
         device_->daemonPid(),
         [&] {
           const auto made = creation.request(*client_);
-          code = made ? kSuccess : made.error().code;
+          code_ = made ? kSuccess : made.error().code;
         },
         judge);
-    return code;
   }
 
-  Creation newCreation(uint64_t containerClass) {
-    return {containerClass, fmt::format("com.example.app{}", ++creations_)};
-  }
-
-  // Creates undisturbed; the first of its class says what a whole container is.
-  void learn(const Creation& creation) {
-    ASSERT_EQ(create(creation, [](const FileCall&, size_t) { return Verdict{}; }), kSuccess);
+  // Creates undisturbed, and says what a whole container is from now on.
+  void learn() {
+    const Creation creation = newCreation();
+    firstCalls_ = create(creation, [](const FileCall&, size_t) { return Verdict{}; });
     const auto made = creation.request(*client_);
     ASSERT_TRUE(made.has_value());
     model_ = pictureOf(made->path);
-    live_ = itemsIn(*device_, creation.classDirectory()).size();
+    ++live_;
   }
 
-  // Nothing half-built is left, and the next request has its container.
-  void expectSound(const Creation& creation, bool wasMade) {
-    EXPECT_EQ(litterThatStays(*device_, creation, kTemporaryMetadata), "");
-    EXPECT_EQ(itemsIn(*device_, creation.classDirectory()).size(), live_ + (wasMade ? 1 : 0));
-    const auto next = creation.request(*client_);
-    ASSERT_TRUE(next.has_value()) << next.error().text << next.error().code;
-    EXPECT_EQ(next->existed, wasMade);
-    EXPECT_EQ(defectOf(creation, next->path, model_), "");
-    live_ = itemsIn(*device_, creation.classDirectory()).size();
-  }
-
-  // Lets call `number` of a creation fail. Returns whether there was such a call.
-  bool failOnce(const Creation& creation, size_t number, int error) {
+  // Lets call `number` of a creation fail, and, with `isForGood`, all that follow. Returns whether
+  // there was such a call.
+  bool fail(size_t number, int error, bool isForGood = false) {
+    const Creation creation = newCreation();
+    const size_t logged = device_->daemonLog().size();
     Progress progress;
-    std::set<uint64_t> expected;
     std::string at;
-    const uint64_t code = create(creation, [&](const FileCall& call, size_t n) {
+    create(creation, [&](const FileCall& call, size_t n) {
       if (n <= number) progress.follow(call);
-      if (n != number) return Verdict{};
-      expected = progress.codes(call);
-      at = fmt::format("{}: {} {}", progress.step().name, call.name, call.path);
-      return Verdict{Verdict::Kind::fail, error};
+      if (n == number) at = fmt::format("{} {}", call.name, call.path);
+      const bool fails = isForGood ? n >= number : n == number;
+      return fails ? Verdict{Verdict::Kind::fail, error} : Verdict{};
     });
-    SCOPED_TRACE(fmt::format("call {}, {}, {}", number, at, std::strerror(error)));
     if (at.empty()) return false;
-    EXPECT_TRUE(expected.contains(code)) << code;
-    expectSound(creation, code == kSuccess);
+    const Step& step = progress.step();
+    SCOPED_TRACE(fmt::format("call {}, {}: {}, code {}", number, at, std::strerror(error), code_));
+    if (isForGood) {
+      // What is in staging cannot be got rid of either.
+      EXPECT_TRUE(!step.hasBuilt || code_ == kNotCleanedUp);
+      EXPECT_NE(code_, 0U);
+    } else {
+      EXPECT_TRUE(progress.codes().contains(code_));
+      EXPECT_TRUE(code_ != step.code ||
+                  device_->daemonLog().find(step.message, logged) != std::string::npos);
+      EXPECT_EQ(litterThatStays(*device_, creation, kTemporaryMetadata), "");
+    }
+    if (code_ == kSuccess) ++live_;
+    EXPECT_EQ(itemsIn(*device_, creation.classDirectory()).size(), live_);
+    const auto next = creation.request(*client_);
+    EXPECT_TRUE(next.has_value()) << (next ? "" : next.error().text);
+    if (!next) return false;
+    EXPECT_EQ(next->existed, code_ == kSuccess);
+    EXPECT_EQ(defectOf(creation, next->path, model_), "");
+    if (code_ != kSuccess) ++live_;
     return true;
   }
 
   std::optional<Device> device_;
   std::optional<tessary::Client> client_;
-  std::map<std::string, std::string> model_;
-  size_t live_ = 0;  // containers of the class
-  std::vector<FileCall> calls_;
+  Picture model_;
+  std::vector<FileCall> firstCalls_;  // of a daemon's first request of the class
+  size_t live_ = 0;                   // containers of the class
+  uint64_t code_ = 0;                 // of the last answer: 1 for success
   int creations_ = 0;
 };
 
-class CreationFaultOf : public CreationFault, public ::testing::WithParamInterface<uint64_t> {};
-
-TEST_P(CreationFaultOf, GivesTheCodeOfTheStepAndLeavesNothing) {
+TEST_P(CreationFault, GivesTheCodeOfTheStepAndLeavesNothing) {
   constexpr std::array<int, 3> kErrors = {EIO, ENOSPC, EACCES};
-  learn(newCreation(GetParam()));
-  size_t faults = 0;
-  for (size_t number = 0; !HasFailure(); number += kSanitizedStride) {
-    const int error = kErrors[number % kErrors.size()];
-    if (!failOnce(newCreation(GetParam()), number, error)) break;
-    ++faults;
-  }
-  EXPECT_GT(faults, 50 / kSanitizedStride);
-  fmt::print("class {:2} {:4} faults\n", GetParam(), faults);
+  size_t number = 0;
+  while (!HasFailure() && fail(number, kErrors[number % 3])) number += kSanitizedStride;
+  EXPECT_GT(number, 50U);
 }
 
 // The first request of a daemon makes the class directory, reads it, and reads the groups.
-TEST_P(CreationFaultOf, OfTheFirstRequestIsNotRemembered) {
-  const auto startAfresh = [&] {
-    device_->kill();
-    std::filesystem::remove_all(device_->path("/private/var/mobile/Containers"));
-    std::filesystem::remove_all(device_->path("/private/var/containers"));
-    start();
-    live_ = 0;
-  };
-  startAfresh();
-  learn(newCreation(GetParam()));
-  const std::vector<FileCall> calls = calls_;
+TEST_P(CreationFault, OfTheFirstRequestIsNotRemembered) {
   Progress progress;
-  size_t faults = 0;
-  for (size_t number = 0; number < calls.size() && !HasFailure(); ++number) {
-    progress.follow(calls[number]);
+  for (size_t number = 0; number < firstCalls_.size() && !HasFailure(); ++number) {
+    progress.follow(firstCalls_[number]);
     if (!progress.isFirstUse() || number % kSanitizedStride != 0) continue;
     startAfresh();
-    EXPECT_TRUE(failOnce(newCreation(GetParam()), number, EIO));
-    ++faults;
+    EXPECT_TRUE(fail(number, EIO));
   }
-  fmt::print("class {:2} {:4} faults in the first request\n", GetParam(), faults);
 }
 
 // The disk goes for good in the middle of a request, and is there again for the next one.
-TEST_P(CreationFaultOf, SurvivesADiskThatIsGone) {
-  const Creation first = newCreation(GetParam());
-  learn(first);
-  const size_t count = calls_.size();
-  for (size_t from = 0; from < count; from += 7 * kSanitizedStride) {
-    SCOPED_TRACE(from);
-    const Creation creation = newCreation(GetParam());
-    Progress progress;
-    const uint64_t code = create(creation, [&](const FileCall& call, size_t n) {
-      if (n <= from) progress.follow(call);
-      return n < from ? Verdict{} : Verdict{Verdict::Kind::fail, EIO};
-    });
-    const bool isBuilt =
-        progress.step().code == kMetadata.code || progress.step().code == kList.code ||
-        progress.step().code == kSubdirectories.code || progress.step().code == kMoving.code;
-    // What is in staging cannot be got rid of either.
-    EXPECT_TRUE(!isBuilt || code == 9U) << code << ' ' << progress.step().name;
-    EXPECT_NE(code, 0U);
-    EXPECT_EQ(itemsIn(*device_, creation.classDirectory()).size(),
-              live_ + (code == kSuccess ? 1 : 0));
-    const auto next = creation.request(*client_);
-    ASSERT_TRUE(next.has_value()) << next.error().text;
-    EXPECT_EQ(defectOf(creation, next->path, model_), "");
-    ++live_;
-  }
-  EXPECT_FALSE(itemsIn(*device_, first.stagingDirectory()).empty());
-  start();
-  EXPECT_EQ(litterThatStays(*device_, first), "");
-}
-
-INSTANTIATE_TEST_SUITE_P(Class, CreationFaultOf, ::testing::Values(2, 12, 13),
-                         [](const auto& each) { return std::to_string(each.param); });
-
-struct Message {
-  uint64_t containerClass;
-  const char* call;
-  const char* pathPart;
-  int occurrence;  // among those calls, from 1
-  uint64_t code;
-  const char* text;
-};
-
-TEST_F(CreationFault, WritesTheMessageOfTheStep) {
-  const Message kMessages[] = {
-      {2, "mkdirat", "-", 1, 7, "Failed to create staging dir at "},
-      {2, "openat", kTemporaryMetadata, 1, 34, "Failed to write metadata dictionary to URL "},
-      {2, "write", "", 1, 34, "Failed to write metadata dictionary to URL "},
-      {2, "fsync", "", 1, 34, "Failed to write metadata dictionary to URL "},
-      {2, "renameat", kTemporaryMetadata, 1, 34, "Failed to move metadata from staging: "},
-      {12, "setxattr", "/proc/self/fd/", 1, 63, "Failed to set ACL on "},
-      {13, "setxattr", "/proc/self/fd/", 2, 63, "Failed to set ACL on "},
-      {2, "mkdirat", "SystemData", 1, 6, "Failed to create sub-dir for "},
-      {2, "fchown", "", 2, 6, "Failed to create sub-dir for "},
-      {12, "mkdirat", "tmp", 1, 6, "Failed to create sub-dir for "},
-      {2, "renameat", "-", 2, 8, "Failed to move staging dir: "},
-      {2, "write", "", 2, kSuccess, "Failed to set mapping for user: "},
-  };
-  for (const uint64_t containerClass : {2U, 12U, 13U}) learn(newCreation(containerClass));
-  for (const Message& message : kMessages) {
-    SCOPED_TRACE(fmt::format("{} {} {}", message.call, message.pathPart, message.occurrence));
-    const Creation creation = newCreation(message.containerClass);
-    int seen = 0;
-    const uint64_t code = create(creation, [&](const FileCall& call, size_t) {
-      const bool isMeant =
-          call.name == message.call && call.path.find(message.pathPart) != std::string::npos;
-      if (!isMeant || ++seen != message.occurrence) return Verdict{};
-      return Verdict{Verdict::Kind::fail, EIO};
-    });
-    EXPECT_EQ(code, message.code);
-    EXPECT_NE(device_->daemonLog().find(message.text), std::string::npos);
-    // The next message is looked for in a log of its own.
-    std::filesystem::resize_file(
-        device_->path("/private/var/root/Library/Logs/Tessary/tessaryd.log"), 0);
-  }
+TEST_P(CreationFault, OfAllCallsFromOneOnIsSurvived) {
+  size_t number = 0;
+  while (!HasFailure() && fail(number, EIO, /*isForGood=*/true)) number += 7 * kSanitizedStride;
+  EXPECT_GT(number, 50U);
+  const Creation creation = newCreation();
+  EXPECT_FALSE(itemsIn(*device_, creation.stagingDirectory()).empty());
+  device_->kill();
+  startAndCleanUp(*device_);
+  EXPECT_EQ(litterThatStays(*device_, creation), "");
 }
 
 // The emptying may find the directory on death row before the container has come into it.
-TEST_F(CreationFault, DeathRowEmptiedUnderAMove) {
-  const Creation creation{2, "com.example.app", /*transient=*/true};
+TEST_P(CreationFault, OfADeathRowThatIsEmptiedUnderAMoveIsNone) {
+  const Creation creation{GetParam(), "com.example.app", /*transient=*/true};
   const auto old = creation.request(*client_);
   ASSERT_TRUE(old.has_value());
-  ASSERT_EQ(litterThatStays(*device_, creation), "");  // what the start has thrown away
   const std::string name = std::filesystem::path(old->path).filename();
   bool wasEmptied = false;
-  const uint64_t code = create(creation, [&](const FileCall& call, size_t) {
+  create(creation, [&](const FileCall& call, size_t) {
     if (wasEmptied || call.name != "renameat" || call.path != name) return Verdict{};
     wasEmptied = true;
     for (const auto& item : itemsIn(*device_, kDeathRow)) {
@@ -304,8 +223,10 @@ TEST_F(CreationFault, DeathRowEmptiedUnderAMove) {
     return Verdict{};
   });
   EXPECT_TRUE(wasEmptied);
-  EXPECT_EQ(code, kSuccess);
-  EXPECT_EQ(itemsIn(*device_, creation.classDirectory()).size(), 1U);
+  EXPECT_EQ(code_, kSuccess);
 }
+
+INSTANTIATE_TEST_SUITE_P(OfClass, CreationFault, ::testing::Values(2, 12),
+                         [](const auto& each) { return std::to_string(each.param); });
 
 }  // namespace

@@ -2,14 +2,11 @@
 
 #include <gtest/gtest.h>
 #include <signal.h>
-#include <sys/mount.h>
 #include <unistd.h>
 
-#include <chrono>
 #include <filesystem>
 #include <fstream>
-#include <sstream>
-#include <thread>
+#include <iterator>
 
 #include "Platform/os/Tasks.h"
 #include "Platform/values/PropertyList.h"
@@ -21,13 +18,10 @@ using platform::Value;
 namespace {
 
 constexpr char kPrefix[] = "com.veltra.private.Tessary.";
-constexpr std::chrono::seconds kPatience{30};
 
 std::string contentOf(const std::string& path) {
-  const std::ifstream file(path);
-  std::stringstream text;
-  text << file.rdbuf();
-  return text.str();
+  std::ifstream file(path);
+  return {std::istreambuf_iterator<char>(file), {}};
 }
 
 void writePropertyList(const std::string& path, const Value& value) {
@@ -67,14 +61,16 @@ std::string Device::program(const std::string& name) {
   return std::string(TESSARY_BINARY_DIRECTORY) + "/" + name;
 }
 
-Device::Device(const std::string& parent) {
+Device::Device(const std::string& parent, const std::string& user) {
   std::string pattern =
       (parent.empty() ? std::filesystem::temp_directory_path().string() : parent) +
       "/tessary-device-XXXXXX";
   if (::mkdtemp(pattern.data()) == nullptr) throw std::runtime_error("mkdtemp " + pattern);
   std::filesystem::permissions(pattern, std::filesystem::perms(0755));
   root_ = std::filesystem::canonical(pattern).string();
-  const Finished prepared = runToEnd({program("tessary-platform"), "--root", root_, "init"});
+  std::vector<std::string> command = {program("tessary-platform"), "--root", root_, "init"};
+  if (!user.empty()) command.insert(command.end(), {"--user", user});
+  const Finished prepared = runToEnd(command);
   EXPECT_EQ(prepared.exitStatus, 0) << prepared.errors;
   reopenRoot();
 }
@@ -87,13 +83,12 @@ Device::~Device() {
 
 void Device::start() {
   daemon_ = startInBackground({program("tessaryd"), "--root", root_}, root_ + "/system.log");
-  const auto deadline = std::chrono::steady_clock::now() + kPatience;
-  while (std::chrono::steady_clock::now() < deadline) {
-    // The socket of the daemon that ran before may still lie there: only an answer counts.
-    if (auto client = tessary::Client::connect(root_); client && client->personaList()) return;
-    std::this_thread::sleep_for(std::chrono::milliseconds(5));
-  }
-  FAIL() << "the daemon does not answer: " << systemLog();
+  // The socket of the daemon that ran before may still lie there: only an answer counts.
+  ASSERT_TRUE(becomes([&] {
+    auto client = tessary::Client::connect(root_);
+    return client && client->personaList();
+  })) << "the daemon does not answer: "
+      << systemLog();
 }
 
 int Device::stop() {
@@ -126,44 +121,25 @@ std::string Device::daemonLog() const {
 Answer Device::ask(const Caller& caller, const std::vector<std::string>& arguments) const {
   const std::string entitlements = root_ + "/entitlements-" + caller.identifier + ".plist";
   writePropertyList(entitlements, caller.entitlements);
-  std::vector<std::string> command = {program("tessary-platform"),
-                                      "--root",
-                                      root_,
-                                      "run",
-                                      "--identifier",
-                                      caller.identifier,
-                                      "--entitlements",
-                                      entitlements,
-                                      "--uid",
-                                      std::to_string(caller.uid),
-                                      "--gid",
-                                      std::to_string(caller.uid)};
+  const std::string uid = std::to_string(caller.uid);
+  std::vector<std::string> command = {program("tessary-platform"), "--root", root_, "run"};
+  command.insert(command.end(), {"--identifier", caller.identifier});
+  command.insert(command.end(), {"--entitlements", entitlements, "--uid", uid, "--gid", uid});
   if (caller.sandboxed) command.emplace_back("--sandboxed");
   if (caller.persona) command.insert(command.end(), {"--persona", *caller.persona});
   command.insert(command.end(), {"--", program("tessaryctl"), "--root", root_, "--json"});
   command.insert(command.end(), arguments.begin(), arguments.end());
   const Finished finished = runToEnd(command);
-  Answer answer{
-      .exitStatus = finished.exitStatus, .code = 0, .json = {}, .errors = finished.errors};
-  if (finished.exitStatus == 0) {
-    answer.code = 1;
-    answer.json = nlohmann::json::parse(finished.output, nullptr, /*allow_exceptions=*/false);
-  } else {
-    answer.code = codeIn(finished.errors);
-  }
-  return answer;
+  const bool isDone = finished.exitStatus == 0;
+  return {.code = isDone ? 1 : codeIn(finished.errors),
+          .json = isDone ? nlohmann::json::parse(finished.output, nullptr, /*exceptions=*/false)
+                         : nlohmann::json(),
+          .errors = finished.errors};
 }
 
-Answer Device::create(const Caller& caller, const std::string& identifier,
+Answer Device::askFor(const char* command, const Caller& caller, const std::string& identifier,
                       uint64_t containerClass) const {
-  std::vector<std::string> arguments = {"create", "--class", std::to_string(containerClass)};
-  if (!identifier.empty()) arguments.push_back(identifier);
-  return ask(caller, arguments);
-}
-
-Answer Device::lookup(const Caller& caller, const std::string& identifier,
-                      uint64_t containerClass) const {
-  std::vector<std::string> arguments = {"lookup", "--class", std::to_string(containerClass)};
+  std::vector<std::string> arguments = {command, "--class", std::to_string(containerClass)};
   if (!identifier.empty()) arguments.push_back(identifier);
   return ask(caller, arguments);
 }
@@ -179,6 +155,7 @@ tessary::Client Device::connect(const Caller& caller) const {
   if (!written) throw std::runtime_error("cannot write a record: " + written.error().message());
   auto client = tessary::Client::connect(root_);
   if (!client) throw std::runtime_error(client.error().text);
+  EXPECT_TRUE(client->personaList());
   return std::move(*client);
 }
 

@@ -28,9 +28,8 @@ struct Caller {
   Caller with(const std::string& name, platform::Value value = true) const;
 };
 
-// What tessaryctl answered: 0 and its JSON, or the daemon's code.
+// What tessaryctl answered: its JSON, or the daemon's code.
 struct Answer {
-  int exitStatus = -1;
   uint64_t code = 0;  // 1 for success; 0 when the daemon could not be asked
   nlohmann::json json;
   std::string errors;
@@ -41,8 +40,9 @@ struct Answer {
 
 class Device {
  public:
-  // Makes and prepares the root, below `parent` (a directory) when given. Starts nothing.
-  explicit Device(const std::string& parent = {});
+  // Makes and prepares the root, below `parent` (a directory) when given, with one more user
+  // ("NAME:UID") when given. Starts nothing.
+  explicit Device(const std::string& parent = {}, const std::string& user = {});
   ~Device();
   Device(const Device&) = delete;
   Device& operator=(const Device&) = delete;
@@ -61,7 +61,6 @@ class Device {
   // it again. Between the two nothing but kill() may be called.
   void releaseRoot() { files_.reset(); }
   void reopenRoot();
-  bool isRunning() const { return daemon_ > 0; }
   pid_t daemonPid() const { return daemon_; }
   // What the daemon wrote to standard error, and its own log.
   std::string systemLog() const;
@@ -70,12 +69,18 @@ class Device {
   // Runs `tessary-platform ... run` of tessaryctl with these arguments (without --root and --json).
   Answer ask(const Caller& caller, const std::vector<std::string>& arguments) const;
   // Shorthands for the subcommands; an empty identifier stands for the caller's own.
-  Answer create(const Caller& caller, const std::string& identifier, uint64_t containerClass) const;
-  Answer lookup(const Caller& caller, const std::string& identifier, uint64_t containerClass) const;
+  Answer create(const Caller& caller, const std::string& identifier,
+                uint64_t containerClass) const {
+    return askFor("create", caller, identifier, containerClass);
+  }
+  Answer lookup(const Caller& caller, const std::string& identifier,
+                uint64_t containerClass) const {
+    return askFor("lookup", caller, identifier, containerClass);
+  }
 
   // A connection of the test's own process, which gets a record with this caller's identifier and
-  // entitlements; its uid is root's. The record is rewritten by each call: connections that are
-  // open keep what they were accepted with.
+  // entitlements; its uid is root's. The daemon has accepted it: the next call rewrites the record,
+  // and open connections keep what they were accepted with.
   tessary::Client connect(const Caller& caller) const;
 
   // Writes etc/tessary/personas.plist whole, atomically.
@@ -94,6 +99,9 @@ class Device {
   static std::string program(const std::string& name);
 
  private:
+  Answer askFor(const char* command, const Caller& caller, const std::string& identifier,
+                uint64_t containerClass) const;
+
   std::string root_;
   std::unique_ptr<platform::FileSystem> files_;
   pid_t daemon_ = -1;

@@ -67,32 +67,11 @@ constexpr KnownCall kFileCalls[] = {
     {SYS_fdatasync, "fdatasync", kNoPath, true},
 };
 
-bool isReceiving(uint64_t number) {
-  return number == SYS_recvfrom || number == SYS_recvmsg;
-}
-
-bool isSending(uint64_t number) {
-  return number == SYS_sendto || number == SYS_sendmsg;
-}
-
 void readMemory(pid_t process, uint64_t address, void* to, size_t size) {
   const iovec local{to, size};
   const iovec remote{reinterpret_cast<void*>(address), size};
   // A read that ends at an unmapped page is short: what is there counts.
   (void)::process_vm_readv(process, &local, 1, &remote, 1, 0);
-}
-
-std::string textAt(pid_t process, uint64_t address) {
-  std::array<char, 512> text{};
-  readMemory(process, address, text.data(), text.size() - 1);
-  return text.data();
-}
-
-uint64_t openFlags(pid_t process, const uint64_t* arguments, bool hasStructure) {
-  if (!hasStructure) return arguments[2];
-  open_how how{};
-  readMemory(process, arguments[2], &how, sizeof how);
-  return how.flags;
 }
 
 // A sanitizer probes memory by writing it to a pipe.
@@ -112,38 +91,34 @@ std::optional<FileCall> fileCall(pid_t process, const SystemCallInfo& info) {
     return std::nullopt;
   }
   if (known->pathArgument != kNoPath) {
-    call.path = textAt(process, info.entry.args[known->pathArgument]);
+    std::array<char, 512> text{};
+    readMemory(process, info.entry.args[known->pathArgument], text.data(), text.size() - 1);
+    call.path = text.data();
   }
   if (known->number == SYS_openat || known->number == SYS_openat2) {
-    const uint64_t flags = openFlags(process, info.entry.args, known->number == SYS_openat2);
-    call.changes = (flags & O_CREAT) != 0;
-    call.locatesOnly = (flags & O_PATH) != 0;
+    open_how how{.flags = info.entry.args[2], .mode = 0, .resolve = 0};
+    if (known->number == SYS_openat2) readMemory(process, info.entry.args[2], &how, sizeof how);
+    call.changes = (how.flags & O_CREAT) != 0;
+    call.locatesOnly = (how.flags & O_PATH) != 0;
   }
   return call;
 }
 
-SystemCallInfo syscallInfo(pid_t thread) {
-  SystemCallInfo info{};
-  ::ptrace(PTRACE_GET_SYSCALL_INFO, thread, sizeof info, &info);
-  return info;
-}
-
-void changeRegisters(pid_t thread, const std::function<void(user_regs_struct&)>& change) {
-  user_regs_struct registers{};
+template <typename Registers>
+void changeRegisters(pid_t thread, int kind, const std::function<void(Registers&)>& change) {
+  Registers registers{};
   iovec area{&registers, sizeof registers};
-  ::ptrace(PTRACE_GETREGSET, thread, NT_PRSTATUS, &area);
+  ::ptrace(PTRACE_GETREGSET, thread, kind, &area);
   change(registers);
-  ::ptrace(PTRACE_SETREGSET, thread, NT_PRSTATUS, &area);
+  ::ptrace(PTRACE_SETREGSET, thread, kind, &area);
 }
 
 // At its entry: no system call has this number.
 void skipCall(pid_t thread) {
 #if defined(__x86_64__)
-  changeRegisters(thread, [](user_regs_struct& registers) { registers.orig_rax = ~0ULL; });
+  changeRegisters<user_regs_struct>(thread, NT_PRSTATUS, [](auto& all) { all.orig_rax = ~0ULL; });
 #elif defined(__aarch64__)
-  int number = -1;
-  iovec area{&number, sizeof number};
-  ::ptrace(PTRACE_SETREGSET, thread, NT_ARM_SYSTEM_CALL, &area);
+  changeRegisters<int>(thread, NT_ARM_SYSTEM_CALL, [](int& number) { number = -1; });
 #else
 #error "the registers of this machine are not known"
 #endif
@@ -151,13 +126,13 @@ void skipCall(pid_t thread) {
 
 // At its exit.
 void setResult(pid_t thread, int error) {
-  changeRegisters(thread, [error](user_regs_struct& registers) {
-    const auto result = static_cast<unsigned long long>(-static_cast<long long>(error));
+  changeRegisters<user_regs_struct>(thread, NT_PRSTATUS, [error](auto& all) {
 #if defined(__x86_64__)
-    registers.rax = result;
+    auto& result = all.rax;
 #else
-    registers.regs[0] = result;
+    auto& result = all.regs[0];
 #endif
+    result = static_cast<unsigned long long>(-static_cast<long long>(error));
   });
 }
 
@@ -263,19 +238,20 @@ class Tracer {
   }
 
   void systemCall(pid_t thread) {
-    const SystemCallInfo info = syscallInfo(thread);
+    SystemCallInfo info{};
+    ::ptrace(PTRACE_GET_SYSCALL_INFO, thread, sizeof info, &info);
     if (info.op == PTRACE_SYSCALL_INFO_ENTRY) {
       inCall_[thread] = info.entry.nr;
       if (thread == serving_) enter(info);
     } else if (info.op == PTRACE_SYSCALL_INFO_EXIT) {
-      const bool hasReceived = isReceiving(inCall_[thread]) && info.exit.rval > 0;
-      if (hasReceived && serving_ < 0) serving_ = thread;
+      const bool isReceiving = inCall_[thread] == SYS_recvfrom || inCall_[thread] == SYS_recvmsg;
+      if (isReceiving && info.exit.rval > 0 && serving_ < 0) serving_ = thread;
       if (thread == serving_) leave();
     }
   }
 
   void enter(const SystemCallInfo& info) {
-    isDone_ = isSending(info.entry.nr);
+    isDone_ = info.entry.nr == SYS_sendto || info.entry.nr == SYS_sendmsg;
     verdict_ = {};
     auto call = fileCall(process_, info);
     if (!call) return;
@@ -315,6 +291,7 @@ class Tracer {
 }  // namespace
 
 std::string whyNotTraceable() {
+  if (::geteuid() != 0) return "needs root";
   const pid_t child = ::fork();
   if (child == 0) {
     ::pause();

@@ -142,7 +142,7 @@ FileDescriptor ServerCore::acceptSocket() {
     errno = EAGAIN;
     return {};
   }
-  FileDescriptor socket(::accept4(listener_.get(), nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC));
+  FileDescriptor socket(::accept4(listener_.get(), nullptr, nullptr, SOCK_CLOEXEC));
   if (socket.valid()) shortageLogged_ = false;
   return socket;
 }

@@ -4,6 +4,7 @@
 #include <pthread.h>
 #include <sys/eventfd.h>
 
+#include <memory>
 #include <system_error>
 
 namespace platform::ipc {
@@ -76,13 +77,13 @@ void WorkerPool::startWorker() {
 
 void WorkerPool::run() {
   ::pthread_setname_np(::pthread_self(), "relay worker");
-  std::vector<uint8_t> scratch(kScratchSize);
+  const auto scratch = std::make_unique_for_overwrite<uint8_t[]>(kScratchSize);
   for (;;) {
     epoll_event event{};
     if (::epoll_wait(epoll_.get(), &event, 1, -1) != 1) continue;  // interrupted
     if (event.data.u64 == kStopToken) return;
     if (free_.fetch_sub(1) == 1) startWorker();
-    handler_(event.data.u64, scratch);
+    handler_(event.data.u64, {scratch.get(), kScratchSize});
     ++free_;
   }
 }

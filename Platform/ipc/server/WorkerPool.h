@@ -46,6 +46,9 @@ class WorkerPool {
   void arm(int descriptor, uint64_t token, uint32_t events);
   void remove(int descriptor);
 
+  // Whether events find a worker: only then may one of them wait for something else for long.
+  bool hasFreeWorker() const { return free_ > 0; }
+
   static constexpr uint64_t kStopToken = UINT64_MAX;
 
  private:

@@ -10,20 +10,6 @@
 namespace platform::ipc {
 namespace {
 
-TEST(PeerTest, AProcessWithoutARecordHasNoIdentity) {
-  TestRoot root;
-  const Tasks tasks(root.files());
-  int pair[2];
-  ASSERT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, pair), 0);
-  const FileDescriptor ours(pair[0]);
-  const FileDescriptor theirs(pair[1]);
-  const auto peer = identifyPeer(ours.get(), tasks);
-  ASSERT_TRUE(peer);
-  EXPECT_EQ(peer->pid(), ::getpid());
-  EXPECT_EQ(peer->uid(), ::geteuid());
-  EXPECT_FALSE(peer->task);
-}
-
 TEST(PeerTest, AProcessThatHasEndedIsNobody) {
   TestRoot root;
   const Tasks tasks(root.files());

@@ -1,111 +1,65 @@
 // What the device is configured with: good files mean what they say, malformed ones the default.
 #include "Platform/os/ContainerLayout.h"
 #include "Platform/os/Device.h"
+#include "Platform/os/DevicePersonas.h"
 #include "Platform/os/KeyBag.h"
-#include "Platform/os/Platform.h"
-#include "Platform/os/SystemVersion.h"
+#include "Platform/os/PersonaList.h"
 #include "Tests/Platform/os/TestRoot.h"
 
 namespace platform {
 namespace {
 
-using Paths = std::vector<std::string>;
-
-TEST(Device, IsWhatItsFileSays) {
+TEST(Device, IsWhatItsFileSaysAndTheDefaultForTheRest) {
   TestRoot root;
+  const char* const file = "etc/tessary/device.plist";
   root.writePropertyList(
-      "etc/tessary/device.plist",
-      Value(Value::Dictionary{
-          {"MultiUserFlags", uint64_t{0x80000000}},
-          {"PersonasRuledOut", true},
-          {"EphemeralStorage", 1},
-          {"Features",
-           Value::Dictionary{{"domain", Value::Dictionary{{"on", true}, {"off", false}}}}}}));
+      file, Value(Value::Dictionary{
+                {"MultiUserFlags", uint64_t{1} << 32},
+                {"PersonasRuledOut", true},
+                {"Features", Value::Dictionary{{"domain", Value::Dictionary{{"on", true}}}}}}));
   const Device device(root.files());
-  EXPECT_TRUE(device.isMultiUser() && device.personasRuledOut() && device.usesEphemeralStorage());
+  EXPECT_EQ(device.multiUserFlags(), std::nullopt) << "out of range";
+  EXPECT_TRUE(device.personasRuledOut() && !device.usesEphemeralStorage());
   EXPECT_TRUE(device.featureEnabled("domain", "on"));
-  EXPECT_FALSE(device.featureEnabled("domain", "off"));
   EXPECT_FALSE(device.featureEnabled("on", "domain"));
-}
-
-TEST(Device, HasDefaultsForWhatIsMissingOrMalformed) {
-  for (const std::string_view content : {"", "bplist00", "<plist><array/></plist>", "<plist>"}) {
-    TestRoot root;
-    if (!content.empty()) root.write("etc/tessary/device.plist", content);
-    const Device device(root.files());
-    EXPECT_EQ(device.multiUserFlags(), 0U) << content;
-    EXPECT_FALSE(device.personasRuledOut() || device.usesEphemeralStorage()) << content;
-    EXPECT_FALSE(device.featureEnabled("domain", "name")) << content;
+  for (const std::string_view content :
+       {"", "bplist00", "<plist><array/></plist>", "<dict><key>Features</key><string/></dict>"}) {
+    root.write(file, content);
+    const Device defaults(root.files());
+    EXPECT_EQ(defaults.multiUserFlags(), 0U) << content;
+    EXPECT_FALSE(defaults.personasRuledOut() || defaults.featureEnabled("domain", "on")) << content;
   }
-  TestRoot root;
-  root.writePropertyList(
-      "etc/tessary/device.plist",
-      Value(Value::Dictionary{{"MultiUserFlags", uint64_t{1} << 32}, {"Features", "all"}}));
-  EXPECT_EQ(Device(root.files()).multiUserFlags(), std::nullopt);
-  EXPECT_FALSE(Device(root.files()).featureEnabled("domain", "name"));
 }
 
-TEST(ContainerLayout, TakesOverridesClassByClass) {
-  TestRoot root;
-  root.writePropertyList(
-      "etc/tessary/container-layout.plist",
-      Value(Value::Dictionary{
-          {"2", Value::Array{"b/c/d", "a"}}, {"77", Value::Array{"x"}}, {"two", 2}}));
-  const ContainerLayout layout(root.files());
-  EXPECT_EQ(layout.subdirectoriesOfClass(2).value(), (Paths{"a", "b", "b/c", "b/c/d"}));
-  EXPECT_EQ(layout.subdirectoriesOfClass(77).value(), Paths{"x"});
-  EXPECT_EQ(layout.subdirectoriesOfClass(4).value(),
-            (Paths{"Library", "Library/Caches", "Library/Preferences", "SystemData", "tmp"}));
-  EXPECT_EQ(layout.subdirectoriesOfClass(8).value(), Paths{});
-  EXPECT_EQ(layout.subdirectoriesOfClass(14).error(), ContainerLayout::kUnknownClass);
-}
-
-TEST(ContainerLayout, LeavesNoWayOutOfTheContainer) {
-  const std::vector<Value> bad{"tmp", Value::Array{1}};
-  const std::vector<std::string> badPaths{"",     "/",   "/etc", "..", "a/../b",
-                                          "a/..", "./a", "a//b", "a/", std::string("a\0b", 3)};
-  const auto codeOf = [](const Value& value) {
+TEST(ContainerLayout, TakesOverridesThatLeaveNoWayOutOfTheContainer) {
+  using Paths = std::vector<std::string>;
+  const std::pair<Value, Paths> cases[] = {{Value::Array{"b/c/d", "a"}, {"a", "b", "b/c", "b/c/d"}},
+                                           {"tmp", {}},
+                                           {Value::Array{1}, {}},
+                                           {Value::Array{"fine", ""}, {}},
+                                           {Value::Array{"fine", "/etc"}, {}},
+                                           {Value::Array{"fine", "a/../b"}, {}},
+                                           {Value::Array{"fine", "./a"}, {}},
+                                           {Value::Array{"fine", "a//b"}, {}},
+                                           {Value::Array{"fine", std::string("a\0b", 3)}, {}}};
+  for (const auto& [value, paths] : cases) {
     TestRoot root;
     root.writePropertyList("etc/tessary/container-layout.plist",
-                           Value(Value::Dictionary{{"2", value}}));
-    const auto layout = ContainerLayout(root.files()).subdirectoriesOfClass(2);
-    return layout ? 0 : layout.error();
-  };
-  for (const Value& value : bad) EXPECT_EQ(codeOf(value), 22U) << value.description();
-  for (const std::string& path : badPaths) {
-    EXPECT_EQ(codeOf(Value::Array{"fine", path}), 22U) << path;
+                           Value(Value::Dictionary{{"2", value}, {"two", 2}}));
+    const ContainerLayout layout(root.files());
+    const auto names = layout.subdirectoriesOfClass(2);
+    EXPECT_EQ(names.value_or(Paths{}), paths) << value.description();
+    EXPECT_EQ(names ? 0 : names.error(), paths.empty() ? 22U : 0U);
+    EXPECT_EQ(layout.subdirectoriesOfClass(4)->size(), 5U) << "the others stay";
+    EXPECT_EQ(layout.subdirectoriesOfClass(14).error(), ContainerLayout::kUnknownClass);
   }
-}
-
-TEST(SystemVersion, ReadsWhatDistributionsWrite) {
-  TestRoot root;
-  const std::string text =
-      "# a comment\nNAME=\"Some \\\"System\\\"\"\nVERSION_ID='1.2'\nVARIANT_ID=internal "
-      "\r\nbroken\n";
-  root.write("etc/os-release", text);
-  const SystemVersion version(root.files());
-  const Value::Dictionary expected{{"ProductName", "Some \"System\""},
-                                   {"ProductVersion", "1.2"},
-                                   {"ProductBuildVersion", "1.2"},
-                                   {"ReleaseType", "internal"}};
-  EXPECT_EQ(Value(version.dictionary()), Value(expected));
-  EXPECT_TRUE(version.isInternalBuild());
-
-  root.write("usr/lib/os-release", text + "BUILD_ID=7B1\nVARIANT_ID=release");
-  std::filesystem::remove(root.path("etc/os-release"));
-  std::filesystem::create_symlink("../usr/lib/os-release", root.path("etc/os-release"));
-  const SystemVersion linked(root.files());
-  EXPECT_EQ(*linked.dictionary().at("ProductBuildVersion").asString(), "7B1");
-  EXPECT_FALSE(linked.isInternalBuild());
 }
 
 TEST(KeyBag, ReadsOneNumber) {
   TestRoot root;
   const KeyBag keyBag(root.files());
   EXPECT_EQ(keyBag.lockState(), 0);
-  ASSERT_TRUE(keyBag.setLockState(KeyBag::kLocked));
-  EXPECT_EQ(keyBag.lockState(), 1);
-  const std::vector<std::pair<std::string_view, int>> cases{
+  const std::pair<std::string_view, int> cases[] = {
       {"2", 2}, {"1\n", 1}, {"", 0}, {"1 1", 0}, {"-1", 0}, {"0x1", 0}, {"99999999999", 0}};
   for (const auto& [content, state] : cases) {
     root.write("run/tessary/keybag", content);
@@ -113,21 +67,41 @@ TEST(KeyBag, ReadsOneNumber) {
   }
 }
 
-TEST(DevicePlatform, TellsTheFileSystemOfTheLock) {
+Value persona(Value uniqueString, Value id, Value kind, const char* key = "Other",
+              Value value = "") {
+  return Value::Dictionary{{"UniqueString", std::move(uniqueString)},
+                           {"PersonaID", std::move(id)},
+                           {"Kind", std::move(kind)},
+                           {key, std::move(value)}};
+}
+
+TEST(PersonaList, IsGoodAsAWholeOrNotAtAll) {
+  const Value good = persona("work", 1000, "enterprise", "LayoutPath", "/private/var/work");
+  const auto list = parsePersonaList(Value::Array{good}, "/root");
+  ASSERT_TRUE(list);
+  EXPECT_EQ(list->front().layoutPath, "/root/private/var/work");
+  for (const Value& bad :
+       {Value("text"), persona("x", 1, "other"), persona("", 1, "system"),
+        persona("x", -1, "system"), persona("work", 1, "system"), persona("x", 1000, "system"),
+        persona("x", "1", "system"), persona("x", 1, 1), persona(1, 1, "system"),
+        persona("x", uint64_t{1} << 31, "system"),
+        persona("x", 1, "enterprise", "LayoutPath", "relative"),
+        persona("x", 1, "enterprise", "LayoutPath", "/a/../b"),
+        persona("x", 1, "enterprise", "LayoutPath", "/"),
+        persona("x", 1, "enterprise", "BundleIdentifiers", "com.example.app"),
+        persona("x", 1, "enterprise", "BundleIdentifiers", Value::Array{1})}) {
+    EXPECT_FALSE(parsePersonaList(Value::Array{good, bad}, "")) << bad.description();
+  }
+}
+
+TEST(DevicePersonas, ArePresentOrAbsentForGood) {
   TestRoot root;
-  const auto device = DevicePlatform::open(root.path("."));
-  ASSERT_TRUE(device);
-  Platform::setCurrent((*device)->platform());
-  Platform& current = Platform::current();
-  EXPECT_EQ(current.files.root(), root.files().root());
-  root.write("file", "content");
-  const auto file = current.files.openItem(root.path("file"));
-  ASSERT_TRUE(file);
-  ASSERT_TRUE(current.keyBag.setLockState(KeyBag::kLocked));
-  EXPECT_EQ(current.files.setProtectionClass(file->get(), 1).error().value, EPERM);
-  ASSERT_TRUE(current.keyBag.setLockState(KeyBag::kUnlocked));
-  EXPECT_TRUE(current.files.setProtectionClass(file->get(), 1));
-  EXPECT_EQ(DevicePlatform::open(root.path("nowhere")).error().value, ENOENT);
+  RunLoop loop;
+  const DevicePersonas absent(root.files(), loop);
+  root.write("etc/tessary/personas.plist", "garbage");
+  EXPECT_FALSE(absent.present());
+  const DevicePersonas broken(root.files(), loop);
+  EXPECT_TRUE(broken.present() && broken.list().empty());
 }
 
 }  // namespace

@@ -5,50 +5,32 @@
 #include <thread>
 #include <vector>
 
-#include "Platform/os/NamedSemaphores.h"
 #include "Tests/Platform/os/TestRoot.h"
 
 namespace platform {
 namespace {
 
 TEST(FileNameForIdentifier, IsAlwaysOneSafeComponent) {
-  const std::vector<std::pair<std::string, std::string>> cases{
+  const std::pair<std::string, std::string> cases[] = {
       {"com.example.App_1-2", "com.example.App_1-2"},
       {"", "%"},
       {"..", "%2E."},
-      {"../../etc/passwd", "%2E.%2F..%2Fetc%2Fpasswd"},
+      {"../etc", "%2E.%2Fetc"},
       {std::string("a\0%\xC3", 4), "a%00%25%C3"},
       {std::string(200, 'a'), std::string(200, 'a')},
   };
   for (const auto& [identifier, name] : cases) EXPECT_EQ(fileNameForIdentifier(identifier), name);
   const std::string longer = fileNameForIdentifier(std::string(201, 'a'));
-  EXPECT_EQ(longer.size(), 2U + 64U);
-  EXPECT_TRUE(longer.starts_with("%%"));
+  EXPECT_TRUE(longer.size() == 66 && longer.starts_with("%%")) << longer;
   EXPECT_NE(longer, fileNameForIdentifier(std::string(202, 'a')));
   EXPECT_LE(fileNameForIdentifier(std::string(100, '/')).size(), 200U);
 }
 
-TEST(RuntimeDirectory, IsEmptiedByARebootOnly) {
-  TestRoot root;
-  const NamedSemaphores semaphores(root.files());
-  ASSERT_TRUE(semaphores.create("first", 0444));
-  EXPECT_EQ(semaphores.create("first", 0444).error().value, EEXIST);
-  ASSERT_TRUE(prepareRuntimeDirectory(root.files()));
-  EXPECT_TRUE(semaphores.exists("first"));
-  for (const std::string_view stored : {"another boot\n", "", "0"}) {
-    ASSERT_TRUE(semaphores.exists("first"));
-    root.write("run/tessary/boot-id", stored);
-    ASSERT_TRUE(prepareRuntimeDirectory(root.files()));
-    EXPECT_FALSE(semaphores.exists("first"));
-    ASSERT_TRUE(semaphores.create("first", 0444));
-  }
-}
-
 // What one has put there after preparing must not be taken away by another that comes later.
-TEST(RuntimeDirectory, IsPreparedByManyAtOnce) {
-  for (int round = 0; round < 20; ++round) {
+TEST(RuntimeDirectory, IsEmptiedOnceByARebootAlsoWhenManyPrepareIt) {
+  for (const std::string_view stored : {"another boot\n", "", "0", "another boot"}) {
     TestRoot root;
-    root.write("run/tessary/boot-id", "another boot");
+    root.write("run/tessary/boot-id", stored);
     root.write("run/tessary/old/file", "old");
     std::vector<std::thread> threads;
     for (int i = 0; i < 8; ++i) {

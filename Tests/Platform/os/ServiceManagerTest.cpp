@@ -1,4 +1,4 @@
-// What the process tells others of itself: the service manager, keep-alive, the system log.
+// What the process tells others of itself: the service manager and the system log.
 #include "Platform/os/ServiceManager.h"
 
 #include <fcntl.h>
@@ -8,36 +8,11 @@
 
 #include <cstdlib>
 #include <regex>
-#include <thread>
 
-#include "Platform/os/KeepAlive.h"
 #include "Platform/os/SystemLog.h"
 
 namespace platform {
 namespace {
-
-TEST(ServiceManager, TellsTheManager) {
-  const FileDescriptor manager(::socket(AF_UNIX, SOCK_DGRAM, 0));
-  const std::string name = "tessary-test-" + std::to_string(::getpid());
-  sockaddr_un address{.sun_family = AF_UNIX, .sun_path = {}};
-  name.copy(address.sun_path + 1, name.size());  // in the abstract name space
-  const auto length = static_cast<socklen_t>(offsetof(sockaddr_un, sun_path) + 1 + name.size());
-  ASSERT_EQ(::bind(manager.get(), reinterpret_cast<sockaddr*>(&address), length), 0);
-  ::setenv("NOTIFY_SOCKET", ("@" + name).c_str(), 1);
-  const auto received = [&] {
-    char text[128] = {};
-    EXPECT_GT(::recv(manager.get(), text, sizeof text - 1, MSG_DONTWAIT), 0);
-    return std::string(text);
-  };
-  const ServiceManager service;
-  service.notifyReady();
-  EXPECT_EQ(received(), "READY=1");
-  service.extendTimeout(std::chrono::seconds(60));
-  EXPECT_EQ(received(), "EXTEND_TIMEOUT_USEC=60000000");
-  EXPECT_EQ(service.watchdogInterval().count(), 0);
-  ::setenv("WATCHDOG_USEC", "3000000", 1);
-  EXPECT_EQ(service.watchdogInterval().count(), 1500000);
-}
 
 TEST(ServiceManager, HandsOverListeningSocketsByName) {
   const ServiceManager service;
@@ -58,22 +33,6 @@ TEST(ServiceManager, HandsOverListeningSocketsByName) {
   EXPECT_FALSE(service.takeSocket("third").valid());
 }
 
-TEST(KeepAlive, WaitsForTheLastTransaction) {
-  KeepAlive keepAlive;
-  EXPECT_TRUE(keepAlive.waitUntilIdle(std::chrono::milliseconds(0)));
-  auto first = std::make_unique<KeepAlive::Transaction>(keepAlive);
-  auto moved = std::make_unique<KeepAlive::Transaction>(std::move(*first));
-  first.reset();
-  EXPECT_EQ(keepAlive.openTransactions(), 1);
-  EXPECT_FALSE(keepAlive.waitUntilIdle(std::chrono::milliseconds(20)));
-  std::thread other([&] {
-    std::this_thread::sleep_for(std::chrono::milliseconds(20));
-    moved.reset();
-  });
-  EXPECT_TRUE(keepAlive.waitUntilIdle(std::chrono::minutes(1)));
-  other.join();
-}
-
 TEST(SystemLog, WritesOneLineForOneMessage) {
   ::testing::internal::CaptureStderr();
   const SystemLog log(LogLevel::standard, /*journal=*/false);
@@ -85,18 +44,6 @@ TEST(SystemLog, WritesOneLineForOneMessage) {
       "\\d{4}-\\d\\d-\\d\\dT\\d\\d:\\d\\d:\\d\\d\\.\\d{6}Z error cache \\[Class operation\\]: "
       "a\\\\nb\\\\x1b\\[2J\\\\x00\xC2\\\\x9b\xC3\xA4 \\(code 73\\)\n");
   EXPECT_TRUE(std::regex_match(text, expected)) << text;
-}
-
-TEST(SystemLog, TakesItsThresholdFromTheEnvironment) {
-  const auto enabledAt = [](const char* level) {
-    ::setenv("TESSARY_LOG_LEVEL", level, 1);
-    const SystemLog log;
-    return std::pair(log.enabled(LogLevel::info), log.enabled(LogLevel::standard));
-  };
-  EXPECT_EQ(enabledAt("debug"), std::pair(true, true));
-  EXPECT_EQ(enabledAt("default"), std::pair(false, true));
-  EXPECT_EQ(enabledAt("error"), std::pair(false, false));
-  EXPECT_EQ(enabledAt("loud"), std::pair(false, true));
 }
 
 }  // namespace

@@ -38,11 +38,6 @@ class TestRoot {
     const auto bytes = writeBinaryPropertyList(value).value();
     write(relative, {reinterpret_cast<const char*>(bytes.data()), bytes.size()});
   }
-  // As the tools do it.
-  void replace(const std::string& relative, const Value& value) const {
-    writePropertyList(relative + ".new", value);
-    std::filesystem::rename(path(relative + ".new"), path(relative));
-  }
   std::string read(const std::string& relative) const {
     std::ifstream file(path(relative), std::ios::binary);
     return {std::istreambuf_iterator<char>(file), {}};

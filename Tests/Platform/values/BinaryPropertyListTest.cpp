@@ -37,29 +37,21 @@ PropertyListResult<Value> readFile(const std::string& file) {
   return readPropertyList({reinterpret_cast<const uint8_t*>(file.data()), file.size()});
 }
 
-// An array or a dictionary ("\xAF", "\xDF") whose size is written with four bytes.
-std::string container(const char* marker, size_t size, const std::string& references) {
+// A string or an array ("\x5F", "\xAF") whose size is written with four bytes.
+std::string sized(const char* marker, const std::string& content) {
   std::string object = marker + "\x12"s;
-  appendNumber(object, size, 4);
-  return object + references;
+  appendNumber(object, content.size(), 4);
+  return object + content;
 }
 
-TEST(BinaryPropertyListTest, ReadsEveryEncodingOfAScalar) {
+// The encodings that the writer never uses.
+TEST(BinaryPropertyListTest, ReadsWhatOthersWrite) {
   const std::pair<std::string, Value> cases[] = {
-      {"\x08", false},
-      {"\x10\xFF", 255},
-      {"\x11\xFF\xFF", 65535},
-      {"\x12\xFF\xFF\xFF\xFF", 4294967295U},
       {"\x13\xFF\xFF\xFF\xFF\xFF\xFF\xFF\xFE", -2},
-      {"\x14" + std::string(8, '\0') + std::string(8, '\xFF'), UINT64_MAX},
       {"\x14" + std::string(15, '\0') + "\x07", 7},
       {"\x14" + std::string(15, '\xFF') + "\xFD", -3},
       {"\x22\x3F\xC0\x00\x00"s, 1.5},
-      {"\x23\xBF\xF8\x00\x00\x00\x00\x00\x00"s, -1.5},
-      {"\x33\x3F\xE0\x00\x00\x00\x00\x00\x00"s, Date{978307200.5}},
       {"\x4F\x11\x00\x02\x00\xFF"s, Value::Data{0x00, 0xFF}},
-      {"\x53\x61\x00\x62"s, "a\0b"s},
-      {"\x64\x00\xE9\x20\xAC\xD8\x3D\xDE\x00"s, "é€😀"},
       {"\x80\x2A", Value::Dictionary{{"CF$UID", 42}}},
       {"\x87" + std::string(8, '\xFF'), Value::Dictionary{{"CF$UID", UINT64_MAX}}},
   };
@@ -68,55 +60,39 @@ TEST(BinaryPropertyListTest, ReadsEveryEncodingOfAScalar) {
     ASSERT_TRUE(value) << value.error().reason;
     EXPECT_EQ(*value, expected) << value->description();
   }
-}
-
-TEST(BinaryPropertyListTest, ReadsEveryWidthAndSharedObjects) {
-  const Value expected = Value::Dictionary{{"k", Value::Array{}}, {"l", Value::Array{}}};
+  const Value shared = Value::Dictionary{{"k", Value::Array{}}, {"l", Value::Array{}}};
   for (size_t width = 1; width <= 8; ++width) {
     std::string references;
     for (const unsigned reference : {1U, 3U, 2U, 2U}) appendNumber(references, reference, width);
-    const auto value =
-        readFile(fileOf({"\xD2" + references, "\x51k", "\xA0", "\x51l"}, width, width));
-    ASSERT_TRUE(value) << value.error().reason;
-    EXPECT_EQ(*value, expected);
+    EXPECT_EQ(readFile(fileOf({"\xD2" + references, "\x51k", "\xA0", "\x51l"}, width, width))
+                  .value_or(nullptr),
+              shared);
   }
 }
 
 TEST(BinaryPropertyListTest, RefusesWhatIsNoPropertyList) {
-  const std::pair<std::string, std::string> cases[] = {
-      {fileOf({std::string(1, '\0')}), "null"},
-      {fileOf({"\xC0"}), "a set"},
-      {fileOf({"\x0F"}), "unknown type"},
-      {fileOf({"\x15" + std::string(32, '\0')}), "more than 16 bytes"},
-      {fileOf({"\x14" + std::string(7, '\0') + "\x01" + std::string(8, '\0')}), "beyond 64 bits"},
-      {fileOf({"\x14" + std::string(8, '\xFF') + std::string(8, '\0')}), "beyond 64 bits"},
-      {fileOf({"\x21\x3C\x00"s}), "real of unknown width"},
-      {fileOf({"\x33\x7F\xF8\x00\x00\x00\x00\x00\x00"s}), "date out of range"},
-      {fileOf({"\x52"
-               "a\x80"}),
-       "ASCII"},
-      {fileOf({"\x61\xD8\x3D"}), "surrogate"},
-      {fileOf({"\x62\xD8\x3D\x00\x61"s}), "surrogate"},
-      {fileOf({"\x61\xDE\x00"s}), "surrogate"},
-      {fileOf({"\x52"
-               "a"}),
-       "cut short"},
-      {fileOf({"\x5F\x13\xFF\xFF\xFF\xFF\xFF\xFF\xFF\xFF"}), "cut short"},
-      {fileOf({"\x6F\x13\x80\x00\x00\x00\x00\x00\x00\x00"s}), "cut short"},
-      {fileOf({"\x5F\x14" + std::string(16, '\0')}), "its size"},
-      {fileOf({"\x5F\x22" + std::string(4, '\0')}), "its size"},
-      {fileOf({"\xA1\x01"}), "does not exist"},
-      {fileOf({"\xA1\x00"s}), "contains itself"},
-      {fileOf({"\xD1\x01\x02", "\x51k", "\xA1\x00"s}), "contains itself"},
-      {fileOf({"\xD1\x01\x01", "\x10\x01"}), "no string"},
-      {fileOf({"\xD2\x01\x02\x01\x01", "\x51k", "\x61\x00k"s}), "already"},
-      {fileOf({"\x87"}), "cut short"},
-      {fileOf({"\x88" + std::string(9, '\0')}), "more than 8 bytes"},
-      {"bplist00", "too short"},
-      {"bplist17" + fileOf({"\x09"}).substr(8), "version"},
+  const std::pair<std::vector<std::string>, std::string> cases[] = {
+      {{"\xC0"}, "a set"},
+      {{"\x0F"}, "unknown type"},
+      {{"\x15" + std::string(32, '\0')}, "more than 16 bytes"},
+      {{"\x14" + std::string(7, '\0') + "\x01" + std::string(8, '\0')}, "beyond 64 bits"},
+      {{"\x21\x3C\x00"s}, "real of unknown width"},
+      {{"\x33\x7F\xF8\x00\x00\x00\x00\x00\x00"s}, "date out of range"},
+      {{"\x51\x80"}, "ASCII"},
+      {{"\x61\xD8\x3D"}, "surrogate"},
+      {{"\x62\xD8\x3D\x00\x61"s}, "surrogate"},
+      {{"\x52" + "a"s}, "cut short"},
+      {{"\x5F\x13\xFF\xFF\xFF\xFF\xFF\xFF\xFF\xFF"}, "cut short"},
+      {{"\x6F\x13\x80\x00\x00\x00\x00\x00\x00\x00"s}, "cut short"},
+      {{"\x5F\x14" + std::string(16, '\0')}, "its size"},
+      {{"\xA1\x01"}, "does not exist"},
+      {{"\xD1\x01\x02", "\x51k", "\xA1\x00"s}, "contains itself"},
+      {{"\xD1\x01\x01", "\x10\x01"}, "no string"},
+      {{"\xD2\x01\x02\x01\x01", "\x51k", "\x61\x00k"s}, "already"},
+      {{"\x88" + std::string(9, '\0')}, "more than 8 bytes"},
   };
-  for (const auto& [file, reason] : cases) {
-    const auto value = readFile(file);
+  for (const auto& [objects, reason] : cases) {
+    const auto value = readFile(fileOf(objects));
     ASSERT_FALSE(value) << reason << ", got " << value->description();
     EXPECT_NE(value.error().reason.find(reason), std::string::npos)
         << value.error().reason << ", not " << reason;
@@ -128,20 +104,9 @@ TEST(BinaryPropertyListTest, ChecksTheTrailer) {
   const size_t trailer = good.size() - 32;
   const std::tuple<size_t, size_t, uint64_t> changes[] = {
       // Field, its width, its value.
-      {6, 1, 0},
-      {6, 1, 9},
-      {7, 1, 0},
-      {7, 1, 9},
-      {8, 8, 0},
-      {8, 8, 2},
-      {8, 8, uint64_t{1} << 63},
-      {16, 8, 1},
-      {16, 8, UINT64_MAX},
-      {24, 8, 7},
-      {24, 8, 8},
-      {24, 8, UINT64_MAX},
-      {24, 8, 11},
-  };
+      {6, 1, 0},  {6, 1, 9},           {7, 1, 0},           {7, 1, 9},
+      {8, 8, 0},  {8, 8, 2},           {16, 8, 1},          {8, 8, 1UL << 63},
+      {24, 8, 7}, {16, 8, UINT64_MAX}, {24, 8, UINT64_MAX}, {24, 8, 11}};
   ASSERT_TRUE(readFile(good));
   for (const auto& [field, width, number] : changes) {
     std::string file = good.substr(0, trailer + field);
@@ -172,45 +137,29 @@ TEST(BinaryPropertyListTest, HoldsItsLimits) {
   EXPECT_EQ(readFile(fileOf(laughs)).error().reason, "too many values");
 
   // One value short of the limit, and at it: the array itself counts.
-  const auto many = [](size_t count) {
-    return readFile(fileOf({container("\xAF", count, std::string(count, '\x01')), "\x09"}));
-  };
-  const auto most = many(Limits::kValues - 1);
-  ASSERT_TRUE(most);
-  EXPECT_TRUE(writeBinaryPropertyList(*most));
-  EXPECT_FALSE(many(Limits::kValues));
-  EXPECT_FALSE(writeBinaryPropertyList(Value::Array(Limits::kValues)));
+  for (const bool isTooMany : {false, true}) {
+    const size_t count = Limits::kValues - (isTooMany ? 0 : 1);
+    const auto many = readFile(fileOf({sized("\xAF", std::string(count, '\x01')), "\x09"}));
+    EXPECT_EQ(!many, isTooMany);
+    EXPECT_EQ(!writeBinaryPropertyList(Value::Array(count, true)), isTooMany);
+  }
 
   // A long string used a hundred times, as a value and as a key of a hundred dictionaries.
-  const std::string text =
-      container("\x5F", Limits::kBytes / 64, std::string(Limits::kBytes / 64, 'x'));
-  const std::string hundred = container("\xAF", 100, std::string(100, '\x01'));
+  const std::string text = sized("\x5F", std::string(Limits::kBytes / 64, 'x'));
+  const std::string hundred = sized("\xAF", std::string(100, '\x01'));
   EXPECT_FALSE(readFile(fileOf({hundred, text})));
   EXPECT_FALSE(readFile(fileOf({hundred, "\xD1\x02\x03", text, "\x09"})));
   // The writer refuses what the reader would: the hundred, though it would write the string once.
   EXPECT_FALSE(writeBinaryPropertyList(Value::Array(100, std::string(Limits::kBytes / 64, 'x'))));
-  EXPECT_FALSE(writeBinaryPropertyList(Value::Data(Limits::kBytes - 8)));
 }
 
 TEST(BinaryPropertyListTest, RefusesToWriteWhatHasNoForm) {
-  for (const Value& value : {Value(), Value(UUID::random()), Value("\xC3"), Value("\xED\xA0\x80"),
-                             Value("\xC0\x80"), Value("\xF4\x90\x80\x80"), Value("a\x80"),
-                             Value(Date{std::numeric_limits<double>::infinity()})}) {
+  for (const Value& value :
+       {Value(), Value(UUID::random()), Value("\xED\xA0\x80"), Value("\xC0\x80"),
+        Value("\xF4\x90\x80\x80"), Value(Date{std::numeric_limits<double>::infinity()})}) {
     EXPECT_FALSE(writeBinaryPropertyList(Value::Array{value})) << value.typeName();
   }
   EXPECT_FALSE(writeBinaryPropertyList(Value::Dictionary{{"\xFF", 1}}));
-}
-
-TEST(BinaryPropertyListTest, WritesEqualScalarsOnceAndKeepsTypesApart) {
-  const Value::Array distinct{
-      true, 1, 1.0, 0.0, -0.0, "\x01", Value::Data{1}, Date{978307201}, "", "é", Value::Data{}};
-  Value::Array doubled = distinct;
-  doubled.insert(doubled.end(), distinct.begin(), distinct.end());
-  doubled.push_back(uint64_t{1});
-  const auto bytes = writeBinaryPropertyList(doubled);
-  ASSERT_TRUE(bytes);
-  EXPECT_EQ((*bytes)[bytes->size() - 17], distinct.size() + 1);  // low byte of the object count
-  EXPECT_EQ(readBinaryPropertyList(*bytes).value_or(nullptr), Value(doubled));
 }
 
 }  // namespace
