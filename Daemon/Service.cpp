@@ -89,7 +89,7 @@ int TSYRunDaemon() {
 
   static SerialQueue& listenerQueue = *new SerialQueue("com.veltra.tessaryd.listener");
   // Open until the service has begun: nothing may go while the queue still has work with it.
-  auto starting = std::make_shared<KeepAlive::Transaction>(platform.keepAlive);
+  auto starting = std::make_shared<KeepAlive::Transaction>(platform.keepAlive, "starting");
   listenerQueue.async([starting] { TSYInitialiseDaemon(); });
   const std::unique_ptr<Server> server = createListener(listenerQueue);
   listenerQueue.async(
@@ -97,7 +97,7 @@ int TSYRunDaemon() {
   platform.runLoop.run();
 
   if (endService(server.get())) return EXIT_SUCCESS;
-  TSYLogWrite(TSYLogLevelError, "Ending with work in hand after {} seconds",
-              kPatienceAtTheEnd.count());
+  TSYLogWrite(TSYLogLevelError, "Ending with work in hand after {} seconds: {}",
+              kPatienceAtTheEnd.count(), fmt::join(platform.keepAlive.openTransactions(), ", "));
   std::_Exit(EXIT_FAILURE);
 }

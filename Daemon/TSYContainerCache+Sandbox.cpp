@@ -2,6 +2,7 @@
 
 #include "Daemon/TSYCodeSigningMapping.h"
 #include "Daemon/TSYContainerCache.h"
+#include "Daemon/TSYException.h"
 #include "Daemon/TSYLog.h"
 #include "Platform/os/Accounts.h"
 #include "Platform/os/Platform.h"
@@ -133,6 +134,14 @@ void TSYContainerCache::_lock_pushMappings(const ClassCache& cache) {
 }
 
 void TSYContainerCache::invalidateUserIdentity(const TSYUserIdentityRef& userIdentity) {
+  // What fails has been logged.
+  (void)TSYCatchingExceptions([&]() -> TSYResult<void> {
+    forget(userIdentity);
+    return {};
+  });
+}
+
+void TSYContainerCache::forget(const TSYUserIdentityRef& userIdentity) {
   const MutexLock lock(cacheLock_);
   const platform::Sandbox::Batch batch(Platform::current().sandbox);
   for (TSYContainerClass containerClass = 1; containerClass < kTSYContainerClassMax;

@@ -229,6 +229,12 @@ TSYResult<TSYMetadataRef> TSYContainerCache::lookUp(const TSYContainerIdentity& 
 
 TSYMetadataRef TSYContainerCache::containerForContainerIdentity(
     const TSYConcreteContainerIdentity& identity) {
+  const auto found = TSYCatchingExceptions(
+      [&]() -> TSYResult<TSYMetadataRef> { return lookUpConcrete(identity); });
+  return found ? *found : nullptr;
+}
+
+TSYMetadataRef TSYContainerCache::lookUpConcrete(const TSYConcreteContainerIdentity& identity) {
   const MutexLock lock(cacheLock_);
   for (const bool transient : {false, true}) {
     const auto cache = _lock_getCache(identity.userIdentity(), identity.containerClass(), transient,

@@ -141,6 +141,7 @@ class TSYContainerCache : public TSYUserIdentityCacheObserver {
 
   TSYResult<TSYMetadataRef> lookUp(const TSYContainerIdentity& identity, bool transient,
                                    bool updateSandbox);
+  TSYMetadataRef lookUpConcrete(const TSYConcreteContainerIdentity& identity);
   TSYResult<std::vector<TSYMetadataRef>> list(const TSYUserIdentityRef& userIdentity,
                                               TSYContainerClass contentClass, bool transient,
                                               bool populateSandboxCache);
@@ -150,6 +151,8 @@ class TSYContainerCache : public TSYUserIdentityCacheObserver {
   TSYResult<void> remove(const TSYUserIdentityRef& userIdentity, TSYContainerClass contentClass,
                          const std::string& identifier, bool transient,
                          const TSYMetadataRef& onlyIf);
+
+  void forget(const TSYUserIdentityRef& userIdentity);
 
   TSYUserIdentityCache& userIdentityCache_;
   TSYCodeSigningMapping& codeSigningMapping_;

@@ -20,7 +20,7 @@ SerialQueue& TSYLockStateQueue() {
 
 void TSYAsyncKeepingAlive(SerialQueue& queue, std::function<void()> work) {
   // Shared because a queue's work must be copyable.
-  auto transaction =
-      std::make_shared<KeepAlive::Transaction>(platform::Platform::current().keepAlive);
+  auto transaction = std::make_shared<KeepAlive::Transaction>(
+      platform::Platform::current().keepAlive, queue.label());
   queue.async([transaction, work = std::move(work)] { work(); });
 }

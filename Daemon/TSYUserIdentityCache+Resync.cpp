@@ -80,8 +80,8 @@ void TSYUserIdentityCache::unregister() {
 void TSYUserIdentityCache::personaListDidUpdate() {
   TSYLogWrite(TSYLogLevelNotice, "The persona list has changed.");
   // Shared, because the queue's work must be copyable.
-  const auto transaction =
-      std::make_shared<platform::KeepAlive::Transaction>(platform::Platform::current().keepAlive);
+  const auto transaction = std::make_shared<platform::KeepAlive::Transaction>(
+      platform::Platform::current().keepAlive, "com.veltra.tessaryd.personaListDidUpdate");
   flushQueue_.async([this, transaction] { flush(); });
 }
 

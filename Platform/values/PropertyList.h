@@ -17,6 +17,8 @@ namespace platform {
 
 struct PropertyListLimits {
   static constexpr size_t kBytes = 16 * 1024 * 1024;
+  // Of the XML form, which is only read: its elements take many times their size in memory.
+  static constexpr size_t kXMLBytes = 2 * 1024 * 1024;
   static constexpr size_t kDepth = 64;
   // Values in the whole tree, an object that is shared counted each time that it is used.
   static constexpr size_t kValues = 1024 * 1024;

@@ -136,7 +136,7 @@ class Reader {
 };
 
 bool Reader::parse(std::string_view text) {
-  if (text.size() > Limits::kBytes) return fail("larger than a property list may be");
+  if (text.size() > Limits::kXMLBytes) return fail("larger than a property list may be");
   if (text.starts_with(kByteOrderMark)) text.remove_prefix(kByteOrderMark.size());
   if (!isXMLText(text)) return fail("not the UTF-8 text that XML is made of");
   const pugi::xml_parse_result result =
