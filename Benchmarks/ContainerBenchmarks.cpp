@@ -1,6 +1,5 @@
 // Creation and scanning of containers beside the bare system calls of the same work on the same
 // file system, in the same run.
-
 #include <benchmark/benchmark.h>
 #include <dirent.h>
 #include <fcntl.h>
@@ -10,7 +9,6 @@
 #include <unistd.h>
 
 #include <array>
-#include <cstdlib>
 #include <memory>
 
 #include "Benchmarks/Samples.h"
@@ -27,10 +25,8 @@ using platform::Value;
 constexpr uid_t kUser = 501;
 constexpr char kMetadataFile[] = ".com.veltra.tessary.metadata.plist";
 
-void check(bool succeeded, const char* what) {
-  if (succeeded) return;
-  fmt::print(stderr, "benchmark: {} failed\n", what);
-  std::exit(EXIT_FAILURE);
+void check(bool succeeded, const char* failure) {
+  if (!succeeded) die(failure);
 }
 
 Value::Data metadata(const std::string& identifier) {
@@ -48,16 +44,17 @@ Value::Data metadata(const std::string& identifier) {
 
 void writeSynced(const std::string& path, const Value::Data& bytes) {
   const FileDescriptor file(::open(path.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0644));
-  check(file.valid(), "open");
-  check(::fsetxattr(file.get(), "trusted.tessary.protection-class", "4", 1, 0) == 0, "fsetxattr");
+  check(file.valid(), "cannot open");
+  check(::fsetxattr(file.get(), "trusted.tessary.protection-class", "4", 1, 0) == 0,
+        "cannot fsetxattr");
   check(::write(file.get(), bytes.data(), bytes.size()) == static_cast<ssize_t>(bytes.size()),
-        "write");
-  check(::fsync(file.get()) == 0, "fsync");
+        "cannot write");
+  check(::fsync(file.get()) == 0, "cannot fsync");
 }
 
 void makeOwnedDirectory(const std::string& path) {
-  check(::mkdir(path.c_str(), 0755) == 0, "mkdir");
-  check(::chown(path.c_str(), kUser, kUser) == 0, "chown");
+  check(::mkdir(path.c_str(), 0755) == 0, "cannot mkdir");
+  check(::chown(path.c_str(), kUser, kUser) == 0, "cannot chown");
 }
 
 // What a creation comes to, and nothing else: no look at what is there, no care for links.
@@ -69,10 +66,12 @@ void createBare(const std::string& staging, const std::string& live, const Value
   const std::string temporary = staging + "/temp_metadata-" + name + ".plist";
   makeOwnedDirectory(container);
   writeSynced(temporary, bytes);
-  check(::rename(temporary.c_str(), (container + "/" + kMetadataFile).c_str()) == 0, "rename");
-  for (const char* subdirectory : kSubdirectories)
+  check(::rename(temporary.c_str(), (container + "/" + kMetadataFile).c_str()) == 0,
+        "cannot rename");
+  for (const char* subdirectory : kSubdirectories) {
     makeOwnedDirectory(container + "/" + subdirectory);
-  check(::rename(container.c_str(), (live + "/" + name).c_str()) == 0, "rename");
+  }
+  check(::rename(container.c_str(), (live + "/" + name).c_str()) == 0, "cannot rename");
 }
 
 void creation(benchmark::State& state) {
@@ -119,7 +118,7 @@ std::string populate(const ScratchDevice& device) {
     const FileDescriptor file(
         ::open((container + "/" + kMetadataFile).c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0644));
     check(::write(file.get(), bytes.data(), bytes.size()) == static_cast<ssize_t>(bytes.size()),
-          "write");
+          "cannot write");
   }
   return directory;
 }
@@ -130,13 +129,13 @@ struct CloseDirectory {
 
 void scanBare(const std::string& directory) {
   const std::unique_ptr<DIR, CloseDirectory> items(::opendir(directory.c_str()));
-  check(items != nullptr, "opendir");
+  check(items != nullptr, "cannot opendir");
   std::array<char, 4096> buffer{};
   while (const dirent* item = ::readdir(items.get())) {
     if (item->d_name[0] == '.') continue;
     const std::string path = directory + "/" + item->d_name + "/" + kMetadataFile;
     const FileDescriptor file(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
-    check(file.valid() && ::read(file.get(), buffer.data(), buffer.size()) > 0, "read");
+    check(file.valid() && ::read(file.get(), buffer.data(), buffer.size()) > 0, "cannot read");
   }
 }
 

@@ -1,6 +1,5 @@
 // Requests beside a bare echo server on the same kind of socket, in turns, so that a drift of the
 // machine's speed meets both.
-
 #include <benchmark/benchmark.h>
 #include <sched.h>
 
@@ -88,6 +87,7 @@ double throughput(const LookupSetUp& setUp, int clients, Connect&& connect) {
   std::atomic<bool> over = false;
   std::atomic<uint64_t> total = 0;
   std::vector<std::thread> threads;
+  threads.reserve(static_cast<size_t>(clients));
   const auto start = Clock::now();
   for (int i = 0; i < clients; ++i) {
     threads.emplace_back([&, socket = connect()] {

@@ -4,6 +4,7 @@
 #include <fmt/format.h>
 #include <signal.h>
 #include <sys/socket.h>
+#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -22,31 +23,33 @@ using platform::FileDescriptor;
 using platform::Value;
 using platform::ipc::Message;
 
-namespace {
-
-[[noreturn]] void die(const std::string& reason) {
+void die(std::string_view reason) {
   fmt::print(stderr, "benchmark: {}\n", reason);
   std::exit(EXIT_FAILURE);
 }
 
+namespace {
+
 std::string makeScratchDirectory() {
   std::string pattern = std::filesystem::temp_directory_path().string() + "/tessary-bench-XXXXXX";
   if (::mkdtemp(pattern.data()) == nullptr) die("cannot make " + pattern);
-  std::filesystem::permissions(pattern, std::filesystem::perms(0755));
+  if (::chmod(pattern.c_str(), 0755) != 0) die("cannot chmod " + pattern);
   return std::filesystem::canonical(pattern).string();
 }
 
 pid_t startProgram(const std::vector<std::string>& arguments) {
   std::vector<char*> pointers;
+  pointers.reserve(arguments.size() + 1);
   for (const std::string& argument : arguments) {
     pointers.push_back(const_cast<char*>(argument.c_str()));
   }
   pointers.push_back(nullptr);
   const pid_t child = ::fork();
+  if (child < 0) die("cannot fork");
   if (child != 0) return child;
   // The log of each request goes where it costs a write and nothing more.
   const int null = ::open("/dev/null", O_RDWR | O_CLOEXEC);
-  ::dup2(null, STDERR_FILENO);
+  if (null < 0 || ::dup2(null, STDERR_FILENO) < 0) ::_exit(EXIT_FAILURE);
   ::execv(pointers[0], pointers.data());
   ::_exit(EXIT_FAILURE);
 }
@@ -105,6 +108,19 @@ void echo(int socket, size_t requestSize, const std::vector<uint8_t>& reply) {
   }
 }
 
+platform::Result<FileDescriptor> connectToDaemon(const std::string& root) {
+  return platform::ipc::connectTo(root + "/run/tessary/com.veltra.tessaryd", SOCK_STREAM);
+}
+
+std::vector<uint8_t> containerFrame(const std::string& identifier, bool createIfNecessary) {
+  Message message;
+  message.set("Command", uint64_t{0});
+  message.set("Identifier", identifier);
+  message.set("ContainerClass", uint64_t{2});
+  message.set("CreateIfNecessary", createIfNecessary);
+  return frameOf(message);
+}
+
 }  // namespace
 
 ScratchDevice::ScratchDevice() : root_(makeScratchDirectory()) {
@@ -128,8 +144,7 @@ void ScratchDevice::start() {
   question.set("Command", uint64_t{32});
   const std::vector<uint8_t> frame = frameOf(question);
   for (int tries = 0; tries < 1000; ++tries) {
-    if (auto socket =
-            platform::ipc::connectTo(root_ + "/run/tessary/com.veltra.tessaryd", SOCK_STREAM)) {
+    if (const auto socket = connectToDaemon(root_)) {
       roundTripOfFrame(socket->get(), frame);
       return;
     }
@@ -158,7 +173,7 @@ uint64_t ScratchDevice::daemonMemory() const {
 }
 
 FileDescriptor ScratchDevice::connect() const {
-  auto socket = platform::ipc::connectTo(root_ + "/run/tessary/com.veltra.tessaryd", SOCK_STREAM);
+  auto socket = connectToDaemon(root_);
   if (!socket) die("cannot connect: " + socket.error().message());
   return std::move(*socket);
 }
@@ -168,6 +183,7 @@ EchoServer::EchoServer(size_t requestSize, size_t replySize) : directory_(makeSc
   if (!listener) die("cannot listen: " + listener.error().message());
   ::fcntl(listener->get(), F_SETFL, ::fcntl(listener->get(), F_GETFL) & ~O_NONBLOCK);
   process_ = ::fork();
+  if (process_ < 0) die("cannot fork");
   if (process_ == 0) serveEcho(listener->get(), requestSize, replySize);
 }
 
@@ -188,19 +204,6 @@ std::vector<uint8_t> frameOf(const Message& message) {
   if (!frame) die(frame.error().reason);
   return std::move(*frame);
 }
-
-namespace {
-
-std::vector<uint8_t> containerFrame(const std::string& identifier, bool createIfNecessary) {
-  Message message;
-  message.set("Command", uint64_t{0});
-  message.set("Identifier", identifier);
-  message.set("ContainerClass", uint64_t{2});
-  message.set("CreateIfNecessary", createIfNecessary);
-  return frameOf(message);
-}
-
-}  // namespace
 
 std::vector<uint8_t> lookupFrame(const std::string& identifier) {
   return containerFrame(identifier, /*createIfNecessary=*/false);

@@ -6,10 +6,14 @@
 
 #include <cstdint>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include "Platform/base/FileDescriptor.h"
 #include "Platform/ipc/Message.h"
+
+// Ends the benchmarks and says why.
+[[noreturn]] void die(std::string_view reason);
 
 class ScratchDevice {
  public:
@@ -25,7 +29,6 @@ class ScratchDevice {
   void stop();
   // Makes the sandbox forget the containers that it was told of. Between stop() and start().
   void forgetMappings() const;
-  pid_t daemonPid() const { return daemon_; }
   // Anonymous memory of the daemon that is in use, in bytes.
   uint64_t daemonMemory() const;
 

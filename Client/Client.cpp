@@ -16,7 +16,19 @@ constexpr uint64_t kSuccess = 1;
 enum Command : uint64_t {
   kCreateOrLookup = 0,
   kContainersOfClass = 1,
+  kReplaceContainer = 2,
+  kStageForDelete = 3,
+  kEmptyDeathRow = 4,
+  kSetInfoValue = 5,
+  kGetInfoValue = 6,
+  kGetMetadata = 7,
+  kRecreateStructure = 8,
+  kRegenerateUUID = 9,
+  kDeleteContainer = 10,
+  kWipePluginData = 11,
+  kDeleteDataContent = 12,
   kSystemContainerPath = 15,
+  kDiskUsage = 23,
   kRetired = 27,
   kPersonaList = 32,
 };
@@ -45,6 +57,27 @@ std::optional<std::vector<std::string>> strings(const Message& reply, std::strin
   return list;
 }
 
+Message requestFor(const ContainerName& container) {
+  Message request;
+  request.set("Identifier", container.identifier);
+  request.set("ContainerClass", container.containerClass);
+  request.set("UUID", container.uuid);
+  if (container.personaUniqueString) {
+    request.set("PersonaUniqueString", *container.personaUniqueString);
+  }
+  return request;
+}
+
+// The keys of a replace, which name two containers.
+void setPrefixed(Message& request, const std::string& prefix, const ContainerName& container) {
+  request.set(prefix + "Identifier", container.identifier);
+  request.set(prefix + "ContainerClass", container.containerClass);
+  request.set(prefix + "ContainerUUID", container.uuid);
+  if (container.personaUniqueString) {
+    request.set(prefix + "PersonaUniqueString", *container.personaUniqueString);
+  }
+}
+
 }  // namespace
 
 Result<Client> Client::connect(const std::string& root) {
@@ -71,6 +104,12 @@ Result<Message> Client::call(uint64_t command, Message request) {
         Error{.kind = Error::Kind::daemon, .code = *code, .text = std::string(errorName(*code))});
   }
   return std::move(*reply);
+}
+
+Result<void> Client::callForNothing(uint64_t command, Message request) {
+  const auto reply = call(command, std::move(request));
+  if (!reply) return std::unexpected(reply.error());
+  return {};
 }
 
 Result<Container> Client::createOrLookup(const std::optional<std::string>& identifier,
@@ -124,6 +163,122 @@ Result<std::vector<ListedContainer>> Client::containersOfClass(ContainerClass co
   return containers;
 }
 
+Result<void> Client::replaceContainer(const ContainerName& old, const ContainerName& replacement) {
+  Message request;
+  setPrefixed(request, "Old", old);
+  setPrefixed(request, "New", replacement);
+  return callForNothing(kReplaceContainer, std::move(request));
+}
+
+Result<void> Client::promoteContainer(const ContainerName& transient) {
+  Message request;
+  setPrefixed(request, "New", transient);
+  request.set("OldIdentifier", transient.identifier);
+  request.set("OldContainerClass", transient.containerClass);
+  if (transient.personaUniqueString) {
+    request.set("OldPersonaUniqueString", *transient.personaUniqueString);
+  }
+  return callForNothing(kReplaceContainer, std::move(request));
+}
+
+Result<void> Client::stageForDelete(const std::vector<ContainerName>& containers) {
+  Value::Array classes;
+  Value::Array uuids;
+  Value::Array identifiers;
+  Value::Array personas;
+  for (const ContainerName& container : containers) {
+    classes.emplace_back(container.containerClass);
+    uuids.emplace_back(container.uuid);
+    identifiers.emplace_back(container.identifier);
+    personas.emplace_back(container.personaUniqueString ? Value(*container.personaUniqueString)
+                                                        : Value());
+  }
+  Message request;
+  request.set("ContainerClassesArray", std::move(classes));
+  request.set("UUIDsArray", std::move(uuids));
+  request.set("IdentifiersArray", std::move(identifiers));
+  request.set("PersonaUniqueStringsArray", std::move(personas));
+  return callForNothing(kStageForDelete, std::move(request));
+}
+
+Result<void> Client::emptyDeathRow() {
+  return callForNothing(kEmptyDeathRow, Message());
+}
+
+Result<void> Client::deleteContainer(const std::string& identifier, ContainerClass containerClass,
+                                     bool transient) {
+  Message request;
+  request.set("Identifier", identifier);
+  request.set("ContainerClass", containerClass);
+  request.set("Transient", transient);
+  return callForNothing(kDeleteContainer, std::move(request));
+}
+
+Result<void> Client::wipePluginData(const std::string& identifier) {
+  Message request;
+  request.set("Identifier", identifier);
+  return callForNothing(kWipePluginData, std::move(request));
+}
+
+Result<void> Client::deleteDataContent(const std::string& identifier,
+                                       ContainerClass containerClass) {
+  Message request;
+  request.set("Identifier", identifier);
+  request.set("ContainerClass", containerClass);
+  return callForNothing(kDeleteDataContent, std::move(request));
+}
+
+Result<void> Client::setInfoValue(const ContainerName& container, const std::string& key,
+                                  const std::optional<Value>& value) {
+  Message request = requestFor(container);
+  request.set("Key", key);
+  if (value) request.set("Value", *value);
+  return callForNothing(kSetInfoValue, std::move(request));
+}
+
+Result<Value> Client::infoValue(const ContainerName& container, const std::string& key) {
+  Message request = requestFor(container);
+  request.set("Key", key);
+  const auto reply = call(kGetInfoValue, std::move(request));
+  if (!reply) return std::unexpected(reply.error());
+  const Value* value = reply->value("ReplyInfoValue");
+  if (value == nullptr) return missing("ReplyInfoValue");
+  return *value;
+}
+
+Result<Metadata> Client::metadata(const ContainerName& container, bool infoRequested) {
+  Message request = requestFor(container);
+  request.set("InfoDictRequested", infoRequested);
+  const auto reply = call(kGetMetadata, std::move(request));
+  if (!reply) return std::unexpected(reply.error());
+  const std::string* path = reply->string("ReplyPath");
+  const auto transient = reply->boolean("ReplyTransient");
+  const Value::Dictionary* info = reply->dictionary("ReplyInfoDictionary");
+  if (path == nullptr) return missing("ReplyPath");
+  if (!transient) return missing("ReplyTransient");
+  return Metadata{.path = *path,
+                  .transient = *transient,
+                  .info = info == nullptr ? std::nullopt : std::optional(*info),
+                  .personaUniqueString = optionalString(*reply, "ReplyPersonaUniqueString"),
+                  .sandboxToken = optionalString(*reply, "ReplySandboxToken")};
+}
+
+Result<void> Client::recreateStructure(const ContainerName& container) {
+  return callForNothing(kRecreateStructure, requestFor(container));
+}
+
+Result<void> Client::regenerateUUID(const ContainerName& container) {
+  return callForNothing(kRegenerateUUID, requestFor(container));
+}
+
+Result<uint64_t> Client::diskUsage(const ContainerName& container) {
+  const auto reply = call(kDiskUsage, requestFor(container));
+  if (!reply) return std::unexpected(reply.error());
+  const auto bytes = reply->uint64("ReplyDiskUsage");
+  if (!bytes) return missing("ReplyDiskUsage");
+  return *bytes;
+}
+
 Result<std::string> Client::systemContainerPath(const std::optional<std::string>& identifier) {
   Message request;
   if (identifier) request.set("Identifier", *identifier);
@@ -135,9 +290,7 @@ Result<std::string> Client::systemContainerPath(const std::optional<std::string>
 }
 
 Result<void> Client::retired() {
-  const auto reply = call(kRetired, Message());
-  if (!reply) return std::unexpected(reply.error());
-  return {};
+  return callForNothing(kRetired, Message());
 }
 
 Result<std::vector<std::string>> Client::personaList() {

@@ -51,6 +51,23 @@ struct ListedContainer {
   std::string personaUniqueString;  // empty without a persona
 };
 
+// One very container.
+struct ContainerName {
+  std::string identifier;
+  ContainerClass containerClass = 0;
+  platform::UUID uuid;
+  // For a class under a user's home; ignored for others.
+  std::optional<std::string> personaUniqueString;
+};
+
+struct Metadata {
+  std::string path;
+  bool transient = false;
+  std::optional<platform::Value::Dictionary> info;  // when it was asked for and is there
+  std::optional<std::string> personaUniqueString;
+  std::optional<std::string> sandboxToken;
+};
+
 struct CreateOrLookupOptions {
   bool createIfNecessary = false;
   bool transient = false;
@@ -72,6 +89,32 @@ class Client {
                                    const CreateOrLookupOptions& options = {});
   Result<std::vector<ListedContainer>> containersOfClass(ContainerClass containerClass,
                                                          bool transient = false);
+  // Puts `replacement` in the place of `old`, whose content is deleted.
+  Result<void> replaceContainer(const ContainerName& old, const ContainerName& replacement);
+  // Makes a transient container the regular one of its identifier; there must be none yet.
+  Result<void> promoteContainer(const ContainerName& transient);
+  // Takes all of them out of sight; the room they take is free when death row has been emptied.
+  Result<void> stageForDelete(const std::vector<ContainerName>& containers);
+  // Returns when death row has been emptied.
+  Result<void> emptyDeathRow();
+  Result<void> deleteContainer(const std::string& identifier, ContainerClass containerClass,
+                               bool transient = false);
+  // The content of a plug-in's data container, or of any container under a user's home.
+  Result<void> wipePluginData(const std::string& identifier);
+  Result<void> deleteDataContent(const std::string& identifier, ContainerClass containerClass);
+
+  // Without a value: removes the key.
+  Result<void> setInfoValue(const ContainerName& container, const std::string& key,
+                            const std::optional<platform::Value>& value);
+  Result<platform::Value> infoValue(const ContainerName& container, const std::string& key);
+  Result<Metadata> metadata(const ContainerName& container, bool infoRequested);
+  // Makes missing directories of the container's default structure anew.
+  Result<void> recreateStructure(const ContainerName& container);
+  // Gives the container's directory a new name.
+  Result<void> regenerateUUID(const ContainerName& container);
+  // In bytes.
+  Result<uint64_t> diskUsage(const ContainerName& container);
+
   // The path of a system container (class 12), which is made when it is not there. Without an
   // identifier: the caller's own.
   Result<std::string> systemContainerPath(const std::optional<std::string>& identifier);
@@ -84,6 +127,9 @@ class Client {
   Result<platform::ipc::Message> call(uint64_t command, platform::ipc::Message request);
 
  private:
+  // A command whose reply carries nothing.
+  Result<void> callForNothing(uint64_t command, platform::ipc::Message request);
+
   explicit Client(platform::ipc::Channel channel) : channel_(std::move(channel)) {}
 
   platform::ipc::Channel channel_;

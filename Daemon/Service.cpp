@@ -1,6 +1,5 @@
 // The listener queue orders everything: initialisation is the first work on it, and the message
 // service accepts its connections on it, so that no client is served before the daemon is ready.
-
 #include "Daemon/Service.h"
 
 #include <atomic>

@@ -126,6 +126,9 @@ void TSYInitialiseDaemon() {
   if (isFirstBoot) {
     TSYLogWrite(TSYLogLevelNotice, "tessaryd performing first boot initialization");
   }
+  TSY_SIGNPOST_BEGIN(BootSetup, kBootSignpost, 0);
+  connection.tessarySetup();
+  TSY_SIGNPOST_END(BootSetup, kBootSignpost, 0);
   followLockState();
   if (isFirstBoot) {
     TSY_SIGNPOST_BEGIN(FirstBootCleanup, kBootSignpost, 0);

@@ -3,6 +3,7 @@
 #include "Daemon/TSYClientConnection.h"
 #include "Daemon/TSYContainerCache.h"
 #include "Daemon/TSYDaemonQueues.h"
+#include "Daemon/TSYException.h"
 #include "Daemon/TSYFileManager.h"
 #include "Daemon/TSYGlobalConfiguration.h"
 #include "Daemon/TSYLog.h"
@@ -34,17 +35,32 @@ void appendItemsInStagingOf(const TSYUserIdentityRef& identity, std::vector<TSYU
   }
 }
 
+// The journal of a replace and its staging directory have the same name.
+bool belongsToReplace(const TSYURL& item) {
+  const std::string journal = std::string(item.lastPathComponent()) + ".plist";
+  return !TSYFileManager::defaultManager().itemDoesNotExistAtURL(
+      TSYGlobalConfiguration::sharedInstance().replaceDirectory().appending(journal));
+}
+
 }  // namespace
 
+void TSYClientConnection::tessarySetup() {
+  const auto recovered = TSYCatchingExceptions([] { return _recoverFromReplaceOperations(); });
+  if (recovered) return;
+  TSYLogWrite(TSYLogLevelError, "Failed recovering from replace operations: {}", recovered.error());
+}
+
 void TSYClientConnection::tessaryCleanupWithCompletion(std::function<void(uint64_t)> completion) {
-  // Everything in staging at start-up belongs to a creation that was cut short.
+  // Everything in staging at start-up belongs to a creation that was cut short, but for what a
+  // replace that could not be repaired keeps there: it may be all that is left of a container.
   std::vector<TSYURL> items = itemsInGlobalStaging();
   userIdentityCache_.forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
       [&items](const TSYUserIdentityRef& identity) {
         if (identity) appendItemsInStagingOf(identity, items);
       });
+  std::erase_if(items, belongsToReplace);
   TSYAsyncKeepingAlive(backgroundQueue(),
-                       [this, items = std::move(items), completion = std::move(completion)] {
+                       [items = std::move(items), completion = std::move(completion)] {
                          for (const TSYURL& item : items) {
                            // What cannot be moved stays for the next start.
                            (void)_moveItemAtURLToDeathRow(item, /*startDeletionThread=*/false);

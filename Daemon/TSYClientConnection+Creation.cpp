@@ -35,8 +35,7 @@ constexpr int kProtectionClassUnprotected = 0;
 // goes to death row, also when an exception passes.
 class Staging {
  public:
-  Staging(TSYClientConnection& connection, TSYURL url)
-      : connection_(connection), url_(std::move(url)) {}
+  explicit Staging(TSYURL url) : url_(std::move(url)) {}
   ~Staging() {
     if (!over_ && TSYFileManager::defaultManager().itemExistsAtURL(url_)) (void)moveAway();
   }
@@ -56,10 +55,9 @@ class Staging {
 
  private:
   TSYResult<void> moveAway() {
-    return connection_._moveItemAtURLToDeathRow(url_, /*startDeletionThread=*/true);
+    return TSYClientConnection::_moveItemAtURLToDeathRow(url_, /*startDeletionThread=*/true);
   }
 
-  TSYClientConnection& connection_;
   const TSYURL url_;
   bool over_ = false;
 };
@@ -90,14 +88,9 @@ bool isExcludedFromUserData(const std::string& name) {
 TSYResult<TSYMetadataRef> TSYClientConnection::createOrLookupContainerWithContainerIdentity(
     const std::optional<TSYContainerIdentity>& identity, bool createIfNecessary, bool transient,
     bool useLocking) {
-  const auto operation = [&] {
-    return createOrLookup(identity, createIfNecessary, transient, useLocking);
-  };
-  if (!TSYGlobalConfiguration::sharedInstance().isInternalImage()) {
-    return TSYCatchingExceptions(operation);
-  }
-  // On an internal build an exception ends the process, with its report, where it was thrown.
-  return [&]() noexcept { return operation(); }();
+  return TSYCatchingExceptionsUnlessInternal(
+      TSYGlobalConfiguration::sharedInstance().isInternalImage(),
+      [&] { return createOrLookup(identity, createIfNecessary, transient, useLocking); });
 }
 
 TSYResult<TSYMetadataRef> TSYClientConnection::createOrLookup(
@@ -119,7 +112,7 @@ TSYResult<TSYMetadataRef> TSYClientConnection::createOrLookup(
 
   TSYContainerCache& cache = TSYContainerCache::sharedInstance();
   if (!transient) {
-    const TSYAllIdentifiersLock lock(TSYAllIdentifiersLock::Mode::reading, useLocking);
+    const TSYAllIdentifiersLock lock(TSYLockMode::reading, useLocking);
     auto found = cache.containerForContainerIdentity(*identity, /*transient=*/false,
                                                      /*updateSandbox=*/true);
     if (found || !found.error().is(TSYErrorNotFound)) return found;
@@ -130,7 +123,7 @@ TSYResult<TSYMetadataRef> TSYClientConnection::createOrLookup(
                                      identity->identifier()));
   }
 
-  const TSYAllIdentifiersLock lock(TSYAllIdentifiersLock::Mode::writing, useLocking);
+  const TSYAllIdentifiersLock lock(TSYLockMode::writing, useLocking);
   // Somebody else may have created it between the two locks.
   auto found = cache.containerForContainerIdentity(*identity, transient, /*updateSandbox=*/true);
   if (!found && !found.error().is(TSYErrorNotFound)) return found;
@@ -169,7 +162,7 @@ TSYResult<TSYMetadataRef> TSYClientConnection::createContainer(const TSYContaine
                                      "Failed to create staging dir at {} : {}", "(null)",
                                      "the user has no home directory"));
   }
-  Staging staging(*this, directory->appending(name));
+  Staging staging(directory->appending(name));
   const auto created = _createTopLevelContainerDirectory(
       staging.url(), identity.containerClass(),
       identity.userIdentity()->posixUIDForContainerClass(identity.containerClass()));

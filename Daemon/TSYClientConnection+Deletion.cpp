@@ -1,8 +1,12 @@
 // Death row: what is to be deleted is renamed out of sight first and removed later, by one task at
 // a time on a queue of its own. Nothing on death row is ever read back.
 
+#include <algorithm>
+
 #include "Daemon/TSYClientConnection.h"
+#include "Daemon/TSYCommandStageForDelete.h"
 #include "Daemon/TSYDaemonQueues.h"
+#include "Daemon/TSYException.h"
 #include "Daemon/TSYFileManager.h"
 #include "Daemon/TSYGlobalConfiguration.h"
 #include "Daemon/TSYLog.h"
@@ -99,4 +103,81 @@ TSYResult<void> TSYClientConnection::_removeItemOrMoveToTempAtURL(const TSYURL& 
   if (moved) return {};
   return TSYFailure(TSYErrorCreate(TSYErrorMoveToTempFailed, moved.error(), TSYLogIt::yes,
                                    "Failed to move dir: {} to: {}", url.path(), temporary.path()));
+}
+
+uint64_t TSYClientConnection::deleteContainerWithContainerIdentity(
+    const TSYContainerIdentity& identity, bool transient) {
+  const auto deleted = TSYCatchingExceptions([&]() -> TSYResult<void> {
+    const auto found = createOrLookupContainerWithContainerIdentity(
+        identity, /*createIfNecessary=*/false, transient, /*useLocking=*/true);
+    if (!found) {
+      TSYLogWrite(TSYLogLevelError,
+                  "Failed to lookup existing container to delete-identity: {}, transient: {:d}",
+                  identity, transient);
+      return TSYFailure(found.error());
+    }
+    commandQueue_->insertCommand(
+        TSYCommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
+            {std::make_shared<const TSYConcreteContainerIdentity>((*found)->containerIdentity())},
+            /*useLocking=*/true, /*onError=*/nullptr));
+    return {};
+  });
+  return deleted ? uint64_t{TSYErrorSuccess} : deleted.error().clientCode();
+}
+
+bool TSYClientConnection::mayWipe(const TSYContainerIdentity& identity) const {
+  if (unrestricted_) return true;
+  if (identity.containerClass() != kTSYContainerClassPluginData || !entitledWipeIdentifiers_) {
+    return false;
+  }
+  return std::ranges::any_of(*entitledWipeIdentifiers_, [&](const platform::Value& entitled) {
+    return entitled.asString() != nullptr && *entitled.asString() == identity.identifier();
+  });
+}
+
+uint64_t TSYClientConnection::deleteDataContainerContentWithContainerIdentity(
+    const TSYContainerIdentity& identity) {
+  if (!TSYIsPerUserClass(identity.containerClass())) {
+    TSYLogWrite(TSYLogLevelError,
+                "Can't wipe container non-data container of type: {}, identifier: {}",
+                identity.containerClass(), identity.identifier());
+    return TSYErrorInvalidObject;
+  }
+  if (!mayWipe(identity)) {
+    if (identity.containerClass() != kTSYContainerClassPluginData) {
+      TSYLogWrite(TSYLogLevelError, "Can't wipe container with of type: {}, identifier: {}",
+                  identity.containerClass(), identity.identifier());
+      return TSYErrorInvalidObject;
+    }
+    TSYLogWrite(TSYLogLevelError, "Not entitled to wipe container with identifier: {}",
+                identity.identifier());
+    return TSYErrorNotEntitled;
+  }
+  const auto wiped = TSYCatchingExceptions([&]() -> TSYResult<uint64_t> { return wipe(identity); });
+  return wiped ? *wiped : wiped.error().clientCode();
+}
+
+uint64_t TSYClientConnection::wipe(const TSYContainerIdentity& identity) {
+  allowOtherIdLookup_ = true;
+  const auto existing = createOrLookupContainerWithContainerIdentity(
+      identity, /*createIfNecessary=*/false, /*transient=*/false, /*useLocking=*/true);
+  if (!existing) {
+    TSYLogWrite(TSYLogLevelError, "Failed to lookup existing container to wipe-identifier: {}",
+                identity.identifier());
+    return existing.error().clientCode();
+  }
+  const auto empty = createOrLookupContainerWithContainerIdentity(
+      identity, /*createIfNecessary=*/true, /*transient=*/true, /*useLocking=*/true);
+  if (!empty) {
+    TSYLogWrite(TSYLogLevelError, "Failed to create transient container for wipe-identifier: {}",
+                identity.identifier());
+    return empty.error().clientCode();
+  }
+  const uint64_t code = replaceContainerIdentity(
+      (*existing)->containerIdentity(), (*empty)->containerIdentity(), /*preserveOldUUID=*/true,
+      /*startDeletionThread=*/true);
+  if (code != TSYErrorSuccess) {
+    TSYLogWrite(TSYLogLevelError, "Failed replace operation during delete all content");
+  }
+  return code;
 }

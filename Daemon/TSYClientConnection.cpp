@@ -127,7 +127,7 @@ TSYResult<std::vector<TSYMetadataRef>> TSYClientConnection::containersWithClass(
                                      "Can't act on an invalid container class: {}",
                                      static_cast<int64_t>(containerClass)));
   }
-  const TSYAllIdentifiersLock lock(TSYAllIdentifiersLock::Mode::reading, /*useLocking=*/true);
+  const TSYAllIdentifiersLock lock(TSYLockMode::reading, /*useLocking=*/true);
   return TSYContainerCache::sharedInstance().allContainersForUserIdentity(
       clientIdentity_ ? clientIdentity_->userIdentity() : nullptr, containerClass, transient);
 }

@@ -90,14 +90,67 @@ class TSYClientConnection {
 
   // Takes an item out of sight: moves it into a new directory on death row. A missing item is
   // success. Code 41.
-  TSYResult<void> _moveItemAtURLToDeathRow(const TSYURL& url, bool startDeletionThread);
+  static TSYResult<void> _moveItemAtURLToDeathRow(const TSYURL& url, bool startDeletionThread);
   // Empties death row on its queue and returns at once. The completion, which may be null, gets 1
   // or the code of the last item that resisted.
-  void deleteContainersOnDeathRowWithCompletion(std::function<void(uint64_t)> completion);
+  static void deleteContainersOnDeathRowWithCompletion(std::function<void(uint64_t)> completion);
+  // Has the container taken out of sight when the request completes. Returns 1, 40 or the code of
+  // the lookup.
+  uint64_t deleteContainerWithContainerIdentity(const TSYContainerIdentity& identity,
+                                                bool transient);
+  // The wipe: puts an empty container in the place of a per-user one, which keeps its identity and
+  // UUID. From then on the connection may look up any identifier. Returns 1, 11 for another class
+  // and for one that the caller may not wipe, 55, or a code of lookup, creation or replace.
+  uint64_t deleteDataContainerContentWithContainerIdentity(const TSYContainerIdentity& identity);
+
+  // --- Replace
+  // ------------------------------------------------------------------------------------
+
+  // Puts the container `replacement` where `old` is, whose content goes to death row; with a plain
+  // `old`, which names no container, makes it a regular one. With preserveOldUUID it takes the old
+  // directory and UUID. Survives a crash at any point: the old or the new container is there then,
+  // whole. Returns 1, or 11, 23, 76, 21, 22, 10, 27, 33, 34, 14, 46, 15, 45, 36, 40, or a code of
+  // the cache or the metadata file. After a failure both are where they were, unless the code
+  // is 36.
+  uint64_t replaceContainerIdentity(const TSYContainerIdentity& old,
+                                    const TSYConcreteContainerIdentity& replacement,
+                                    bool preserveOldUUID, bool startDeletionThread);
+
+  // --- Info values and queries
+  // --------------------------------------------------------------------
+  // Each fails with code 21 when the very container is not there.
+
+  // Sets a value of the container's info dictionary; none removes the key. Codes 38 without a key,
+  // 34, 45.
+  TSYResult<void> setInfoValue(const std::optional<platform::Value>& value,
+                               const std::optional<std::string>& key,
+                               const TSYConcreteContainerIdentity& identity, bool useLocking);
+  // Codes 38 without a key, 24 (not logged) without a value.
+  TSYResult<platform::Value> infoValueForKey(const std::optional<std::string>& key,
+                                             const TSYConcreteContainerIdentity& identity,
+                                             bool useLocking);
+  TSYResult<TSYMetadataRef> metadataWithContainerIdentity(
+      const TSYConcreteContainerIdentity& identity);
+  // Makes the directories anew that every container of the class has, and touches nothing else.
+  TSYResult<void> recreateDefaultStructureWithContainerIdentity(
+      const TSYConcreteContainerIdentity& identity);
+  // Gives the directory a new name; the container's UUID stays. Codes 11 for one whose name is no
+  // UUID, 48, 45, 40.
+  TSYResult<void> regenerateDirectoryUUIDWithContainerIdentity(
+      const TSYConcreteContainerIdentity& identity);
+  // Bytes. A bundle is measured once and the size remembered in its info dictionary. Code 40.
+  TSYResult<uint64_t> diskUsageWithContainerIdentity(const TSYConcreteContainerIdentity& identity);
+  // The groups of an owner, by group identifier, made where they are missing. Codes 55, 40.
+  using GroupContainers = std::map<std::string, TSYMetadataRef>;
+  TSYResult<GroupContainers> groupContainersForOwnerIdentifier(
+      const std::string& ownerIdentifier, const TSYUserIdentityRef& userIdentity,
+      TSYContainerClass groupContainerClass);
 
   // --- Boot
   // ---------------------------------------------------------------------------------------
 
+  // Run at every start, before any request is served: repairs replaces that were cut short.
+  void tessarySetup();
   // Run at every start: throws away what is left in the staging directories and empties death row,
   // in the background. The completion, which may be null, gets the code of the emptying.
   void tessaryCleanupWithCompletion(std::function<void(uint64_t)> completion);
@@ -135,6 +188,33 @@ class TSYClientConnection {
   void queueOrphanCleanup(const TSYUserIdentityRef& userIdentity, TSYContainerClass containerClass);
   void _cleanupOrphanedDataForDirectories(const std::optional<std::vector<TSYURL>>& directories,
                                           TSYContainerClass containerClass);
+
+  bool mayWipe(const TSYContainerIdentity& identity) const;
+  uint64_t wipe(const TSYContainerIdentity& identity);
+
+  // Where the containers of a replace are, as its journal has it.
+  struct ReplaceURLs {
+    TSYURL old;
+    TSYURL replacement;
+    TSYURL staging;
+    TSYURL destination;
+  };
+  TSYResult<void> replace(const TSYContainerIdentity& old,
+                          const TSYConcreteContainerIdentity& replacement, bool preserveOldUUID,
+                          bool startDeletionThread);
+  TSYResult<void> replaceJournalled(const TSYMetadataRef& old, const TSYMetadataRef& replacement,
+                                    const TSYURL& destination, bool preserveOldUUID,
+                                    bool startDeletionThread);
+  static TSYResult<void> _writeToDiskReplaceAt(const TSYURL& journal, const ReplaceURLs& urls);
+  static TSYResult<ReplaceURLs> _readAndValidateReplaceFileAtUrl(const TSYURL& journal);
+  static TSYResult<void> _recoverFromReplaceOperations();
+  static TSYResult<void> recoverFromReplaceOperation(const TSYURL& journal);
+
+  TSYResult<void> checkGroupAccess(const std::string& ownerIdentifier,
+                                   TSYContainerClass groupContainerClass);
+  TSYResult<void> regenerateDirectoryUUID(const TSYConcreteContainerIdentity& identity);
+  TSYResult<uint64_t> diskUsage(const TSYConcreteContainerIdentity& identity);
+  void _regenerateAllSystemContainerPaths();
 
   static uint64_t emptyDeathRow();
   static TSYResult<void> _removeItemOrMoveToTempAtURL(const TSYURL& url);

@@ -48,7 +48,7 @@ class TSYClientIdentity {
   const TSYUserIdentityRef& userIdentity() const { return userIdentity_; }
   const platform::AuditToken& auditToken() const { return auditToken_; }
 
-  // YES only for a number that is true under this key.
+  // True only for a number that is true under this key.
   bool boolValueOfEntitlement(std::string_view entitlement) const;
   // Null when there is no value.
   const platform::Value* valueOfEntitlement(std::string_view entitlement) const;

@@ -26,3 +26,21 @@ std::optional<std::string> TSYCodeSigningMapping::parentIdentifierForChildIdenti
     const std::string& /*identifier*/) {
   return std::nullopt;
 }
+
+std::optional<std::vector<std::string>> TSYCodeSigningMapping::appGroupIdentifiersForIdentifier(
+    const std::string& /*identifier*/) {
+  return std::nullopt;
+}
+
+std::optional<std::vector<std::string>> TSYCodeSigningMapping::systemGroupIdentifiersForIdentifier(
+    const std::string& /*identifier*/) {
+  return std::nullopt;
+}
+
+void TSYCodeSigningMapping::removeCodeSigningDictionariesForIdentifierAndItsChildren(
+    const std::string& /*identifier*/, TSYCommandQueue& /*commandQueue*/) {}
+
+TSYResult<void> TSYCodeSigningMapping::invalidateCodeSigningInfoForIdentifierAndItsChildren(
+    const std::string& /*identifier*/) {
+  return {};
+}

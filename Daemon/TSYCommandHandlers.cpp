@@ -6,14 +6,6 @@
 
 using platform::Value;
 
-namespace {
-
-std::optional<std::string> personaOf(const TSYMetadata& container) {
-  return container.userIdentity() ? container.userIdentity()->personaUniqueString() : std::nullopt;
-}
-
-}  // namespace
-
 uint64_t TSYHandleCreateOrLookup(TSYRelayEvent& event, TSYClientConnection& connection) {
   auto identity =
       TSYResolveContainerIdentity(event.request, connection, TSYIdentifierFallback::client);
@@ -28,7 +20,7 @@ uint64_t TSYHandleCreateOrLookup(TSYRelayEvent& event, TSYClientConnection& conn
   event.reply.set("ReplyExisted", container.existed());
   event.reply.set("ReplyPath", container.url().path());
   event.reply.set("ReplyIdentifier", container.identifier());
-  if (const auto persona = personaOf(container)) {
+  if (const auto persona = TSYPersonaUniqueStringOf(container)) {
     event.reply.set("ReplyPersonaUniqueString", *persona);
   }
   if (auto token = TSYIssueSandboxExtension(container, *connection.clientIdentity())) {
@@ -48,7 +40,7 @@ uint64_t TSYHandleContainersOfClass(TSYRelayEvent& event, TSYClientConnection& c
   for (const TSYMetadataRef& container : *containers) {
     identifiers.emplace_back(container->identifier());
     uuids.emplace_back(container->uuid());
-    personas.emplace_back(personaOf(*container).value_or(""));
+    personas.emplace_back(TSYPersonaUniqueStringOf(*container).value_or(""));
   }
   event.reply.set("ReplyIdsArray", std::move(identifiers));
   event.reply.set("ReplyUUIDsArray", std::move(uuids));

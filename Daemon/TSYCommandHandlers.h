@@ -10,6 +10,24 @@ uint64_t TSYHandleCreateOrLookup(TSYRelayEvent& event, TSYClientConnection& conn
 uint64_t TSYHandleContainersOfClass(TSYRelayEvent& event, TSYClientConnection& connection);
 uint64_t TSYHandleSystemContainerPath(TSYRelayEvent& event, TSYClientConnection& connection);
 uint64_t TSYHandlePersonaList(TSYRelayEvent& event, TSYClientConnection& connection);
+
+// TSYRemovalHandlers.cpp
+uint64_t TSYHandleReplaceContainer(TSYRelayEvent& event, TSYClientConnection& connection);
+uint64_t TSYHandleStageForDelete(TSYRelayEvent& event, TSYClientConnection& connection);
+// Replies when death row has been emptied.
+uint64_t TSYHandleEmptyDeathRow(TSYRelayEvent& event, TSYClientConnection& connection);
+uint64_t TSYHandleDeleteContainer(TSYRelayEvent& event, TSYClientConnection& connection);
+uint64_t TSYHandleWipePluginData(TSYRelayEvent& event, TSYClientConnection& connection);
+uint64_t TSYHandleDeleteDataContent(TSYRelayEvent& event, TSYClientConnection& connection);
+
+// TSYInfoHandlers.cpp
+uint64_t TSYHandleSetInfoValue(TSYRelayEvent& event, TSYClientConnection& connection);
+uint64_t TSYHandleGetInfoValue(TSYRelayEvent& event, TSYClientConnection& connection);
+uint64_t TSYHandleGetMetadata(TSYRelayEvent& event, TSYClientConnection& connection);
+uint64_t TSYHandleRecreateStructure(TSYRelayEvent& event, TSYClientConnection& connection);
+uint64_t TSYHandleRegenerateUUID(TSYRelayEvent& event, TSYClientConnection& connection);
+uint64_t TSYHandleDiskUsage(TSYRelayEvent& event, TSYClientConnection& connection);
+
 // A command that there was once.
 uint64_t TSYHandleRetired(TSYRelayEvent& event, TSYClientConnection& connection);
 // A command whose operation is not built yet.

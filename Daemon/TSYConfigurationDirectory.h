@@ -1,4 +1,4 @@
-// How the configuration objects make their directories.
+// How the configuration objects make their directories. Any thread.
 #pragma once
 
 #include <source_location>

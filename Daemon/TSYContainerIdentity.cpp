@@ -111,7 +111,7 @@ bool TSYConcreteContainerIdentity::isEqualToConcreteContainerIdentity(
 }
 
 bool TSYConcreteContainerIdentity::isEqual(const TSYContainerIdentity& other) const {
-  const auto* concrete = dynamic_cast<const TSYConcreteContainerIdentity*>(&other);
+  const TSYConcreteContainerIdentity* concrete = orNull(other);
   return concrete != nullptr && isEqualToConcreteContainerIdentity(*concrete);
 }
 

@@ -2,6 +2,7 @@
 // carries the container's UUID. Plain values, shared between threads without locking.
 #pragma once
 
+#include <memory>
 #include <optional>
 #include <string>
 
@@ -51,8 +52,15 @@ class TSYContainerIdentity {
   TSYContainerClass containerClass_;
 };
 
+// A plain or a concrete one; never null.
+using TSYContainerIdentityRef = std::shared_ptr<const TSYContainerIdentity>;
+
 class TSYConcreteContainerIdentity : public TSYContainerIdentity {
  public:
+  // `identity` itself when it is a concrete one, else null.
+  static const TSYConcreteContainerIdentity* orNull(const TSYContainerIdentity& identity) {
+    return dynamic_cast<const TSYConcreteContainerIdentity*>(&identity);
+  }
   // As the plain one; code 11 also without a UUID.
   static TSYResult<TSYConcreteContainerIdentity> containerIdentityWithUUID(
       const std::optional<platform::UUID>& uuid, TSYUserIdentityRef userIdentity,

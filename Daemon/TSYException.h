@@ -20,3 +20,13 @@ auto TSYCatchingExceptions(Operation&& operation,
     return TSYFailure(TSYErrorFromCurrentException(where));
   }
 }
+
+// The same, unless it runs on an internal build: there an exception ends the process, with its
+// report, where it was thrown.
+template <typename Operation>
+auto TSYCatchingExceptionsUnlessInternal(
+    bool isInternalImage, Operation&& operation,
+    std::source_location where = std::source_location::current()) -> decltype(operation()) {
+  if (isInternalImage) return [&]() noexcept { return operation(); }();
+  return TSYCatchingExceptions(std::forward<Operation>(operation), where);
+}

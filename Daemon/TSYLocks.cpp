@@ -230,9 +230,19 @@ void TSYUnlockAllIdentifiers() {
   TSYLogWrite(TSYLogLevelDebug, "Unlocked all identifiers");
 }
 
-TSYAllIdentifiersLock::TSYAllIdentifiersLock(Mode mode, bool useLocking) : held_(useLocking) {
+TSYIdentifierLock::TSYIdentifierLock(TSYLockMode mode, std::string identifier, bool useLocking)
+    : identifier_(std::move(identifier)), held_(useLocking) {
+  if (held_) takeOneLock(identifier_, /*writing=*/mode == TSYLockMode::writing);
+}
+
+TSYIdentifierLock::~TSYIdentifierLock() {
+  if (held_) TSYUnlockIdentifier(identifier_);
+}
+
+TSYAllIdentifiersLock::TSYAllIdentifiersLock(TSYLockMode mode, bool useLocking)
+    : held_(useLocking) {
   if (!held_) return;
-  if (mode == Mode::writing) {
+  if (mode == TSYLockMode::writing) {
     TSYLockAllIdentifiersForWriting();
   } else {
     TSYLockAllIdentifiersForReading();

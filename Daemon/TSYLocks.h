@@ -28,12 +28,25 @@ void TSYLockAllIdentifiersForReading();
 void TSYLockAllIdentifiersForWriting();
 void TSYUnlockAllIdentifiers();
 
+enum class TSYLockMode { reading, writing };
+
+// Holds one identifier for a scope, when the operation was asked to do its own locking.
+class TSYIdentifierLock {
+ public:
+  TSYIdentifierLock(TSYLockMode mode, std::string identifier, bool useLocking);
+  ~TSYIdentifierLock();
+  TSYIdentifierLock(const TSYIdentifierLock&) = delete;
+  TSYIdentifierLock& operator=(const TSYIdentifierLock&) = delete;
+
+ private:
+  const std::string identifier_;
+  const bool held_;
+};
+
 // Holds a global lock for a scope, when the operation was asked to do its own locking.
 class TSYAllIdentifiersLock {
  public:
-  enum class Mode { reading, writing };
-
-  TSYAllIdentifiersLock(Mode mode, bool useLocking);
+  TSYAllIdentifiersLock(TSYLockMode mode, bool useLocking);
   ~TSYAllIdentifiersLock();
   TSYAllIdentifiersLock(const TSYAllIdentifiersLock&) = delete;
   TSYAllIdentifiersLock& operator=(const TSYAllIdentifiersLock&) = delete;

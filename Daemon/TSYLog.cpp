@@ -1,6 +1,5 @@
 // The daemon log is a rotating file of spdlog's; the system log is the platform's. Neither takes a
 // lock of the daemon's, so both may be written from anywhere.
-
 #include "Daemon/TSYLog.h"
 
 #include <cxxabi.h>
@@ -16,7 +15,6 @@
 #include <cstdlib>
 #include <exception>
 #include <memory>
-#include <new>
 
 #include "Daemon/TSYTypeName.h"
 #include "Platform/base/Mutex.h"

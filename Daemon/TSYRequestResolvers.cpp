@@ -16,6 +16,11 @@ std::optional<std::string> stringUnder(const Message& request, std::string_view 
   return value == nullptr ? std::nullopt : std::optional(*value);
 }
 
+std::optional<platform::UUID> uuidUnder(const Message& request, std::string_view key) {
+  const platform::UUID* value = request.uuid(key);
+  return value == nullptr ? std::nullopt : std::optional(*value);
+}
+
 std::string descriptionOf(const TSYUserIdentityCache::IdentitySet& identities) {
   std::string text = "{(";
   for (const TSYUserIdentityRef& identity : identities) {
@@ -48,6 +53,29 @@ TSYResolved<TSYContainerClass> resolveClass(const Message& request, std::string_
                                         TSYLogIt::yes, "Passed an unexpected container type: {}",
                                         containerClass)
                              .code());
+}
+
+// What the keys of a container name, without its UUID.
+struct NamedContainer {
+  std::string identifier;
+  TSYContainerClass containerClass;
+  TSYUserIdentityRef userIdentity;
+};
+
+TSYResolved<NamedContainer> resolveNamed(const Message& request,
+                                         const TSYClientConnection& connection,
+                                         const TSYConcreteKeys& keys) {
+  auto identifier = stringUnder(request, keys.identifier);
+  if (!identifier) return std::unexpected(uint64_t{TSYErrorMissingIdentifier});
+  const auto containerClass = resolveClass(request, keys.containerClass);
+  if (!containerClass) return std::unexpected(containerClass.error());
+  NamedContainer named{std::move(*identifier), *containerClass, clientsUser(connection)};
+  if (TSYUserIdentity::isUserIdentityRequiredForContainerClass(*containerClass)) {
+    auto persona = TSYResolvePersona(connection, stringUnder(request, keys.persona));
+    if (!persona) return std::unexpected(persona.error());
+    named.userIdentity = std::move(*persona);
+  }
+  return named;
 }
 
 // The sandbox extension class of a container class; null when there is none.
@@ -144,22 +172,32 @@ TSYResolved<TSYUserIdentityRef> TSYResolvePersona(const TSYClientConnection& con
 
 TSYResolved<TSYConcreteContainerIdentity> TSYResolveConcreteContainerIdentity(
     const Message& request, const TSYClientConnection& connection, const TSYConcreteKeys& keys) {
-  const auto identifier = stringUnder(request, keys.identifier);
-  if (!identifier) return std::unexpected(uint64_t{TSYErrorMissingIdentifier});
-  const auto containerClass = resolveClass(request, keys.containerClass);
-  if (!containerClass) return std::unexpected(containerClass.error());
-  TSYUserIdentityRef userIdentity = clientsUser(connection);
-  if (TSYUserIdentity::isUserIdentityRequiredForContainerClass(*containerClass)) {
-    auto persona = TSYResolvePersona(connection, stringUnder(request, keys.persona));
-    if (!persona) return std::unexpected(persona.error());
-    userIdentity = std::move(*persona);
-  }
-  const platform::UUID* uuid = request.uuid(keys.uuid);
+  auto named = resolveNamed(request, connection, keys);
+  if (!named) return std::unexpected(named.error());
   auto identity = TSYConcreteContainerIdentity::containerIdentityWithUUID(
-      uuid == nullptr ? std::nullopt : std::optional(*uuid), std::move(userIdentity), *identifier,
-      *containerClass);
+      uuidUnder(request, keys.uuid), std::move(named->userIdentity), std::move(named->identifier),
+      named->containerClass);
   if (!identity) return std::unexpected(identity.error().clientCode());
   return std::move(*identity);
+}
+
+TSYResolved<TSYContainerIdentityRef> TSYResolveNamedContainerIdentity(
+    const Message& request, const TSYClientConnection& connection, const TSYConcreteKeys& keys) {
+  if (uuidUnder(request, keys.uuid)) {
+    auto concrete = TSYResolveConcreteContainerIdentity(request, connection, keys);
+    if (!concrete) return std::unexpected(concrete.error());
+    return std::make_shared<const TSYConcreteContainerIdentity>(std::move(*concrete));
+  }
+  auto named = resolveNamed(request, connection, keys);
+  if (!named) return std::unexpected(named.error());
+  auto plain = TSYContainerIdentity::containerIdentityWithUserIdentity(
+      std::move(named->userIdentity), std::move(named->identifier), named->containerClass);
+  if (!plain) return std::unexpected(plain.error().clientCode());
+  return std::make_shared<const TSYContainerIdentity>(std::move(*plain));
+}
+
+std::optional<std::string> TSYPersonaUniqueStringOf(const TSYMetadata& container) {
+  return container.userIdentity() ? container.userIdentity()->personaUniqueString() : std::nullopt;
 }
 
 std::optional<std::string> TSYIssueSandboxExtension(const TSYMetadata& container,

@@ -58,6 +58,14 @@ TSYResolved<TSYConcreteContainerIdentity> TSYResolveConcreteContainerIdentity(
     const platform::ipc::Message& request, const TSYClientConnection& connection,
     const TSYConcreteKeys& keys = {});
 
+// The plain identity under the keys when the request carries no UUID, else the concrete one.
+TSYResolved<TSYContainerIdentityRef> TSYResolveNamedContainerIdentity(
+    const platform::ipc::Message& request, const TSYClientConnection& connection,
+    const TSYConcreteKeys& keys);
+
+// What a reply says of a container's persona; none without one.
+std::optional<std::string> TSYPersonaUniqueStringOf(const TSYMetadata& container);
+
 // A file extension token for a sandboxed client's enterprise container; none for any other, and
 // when the sandbox issues none (logged).
 std::optional<std::string> TSYIssueSandboxExtension(const TSYMetadata& container,

@@ -85,10 +85,6 @@ void TSYUserIdentityCache::personaListDidUpdate() {
   flushQueue_.async([this, transaction] { flush(); });
 }
 
-void TSYUserIdentityCache::waitForFlushes() {
-  flushQueue_.sync([] {});
-}
-
 const TSYPersonaMirror& TSYUserIdentityCache::_lock_mirror() {
   if (cacheInvalid_) _lock_resync();
   return mirror_;

@@ -85,8 +85,6 @@ class TSYUserIdentityCache {
   void flushAndRepopulateWithUserIdentities(const std::vector<TSYUserIdentityRef>& identities);
   // The persona list has changed: flushes on the flush queue.
   void personaListDidUpdate();
-  // Returns once every flush asked for so far has been done. For tests.
-  void waitForFlushes();
 
   // An observer removes itself before it goes. removeObserver() waits until no other thread is
   // telling it of anything, so its caller holds no lock that the observer takes.

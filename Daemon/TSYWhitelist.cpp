@@ -104,8 +104,9 @@ std::optional<std::string> TSYWhitelist::wellknownSystemGroupContainerForId(
 
 std::optional<std::string> TSYWhitelist::wellknownContainerForId(
     const std::string& identifier, TSYContainerClass containerClass) const {
-  if (containerClass == kTSYContainerClassSystemData)
+  if (containerClass == kTSYContainerClassSystemData) {
     return wellknownSystemContainerForId(identifier);
+  }
   if (containerClass == kTSYContainerClassSystemGroup) {
     return wellknownSystemGroupContainerForId(identifier);
   }

@@ -36,7 +36,7 @@ class TSYWhitelist {
                                                      TSYContainerClass containerClass) const;
   bool systemContainerIdIsWellknown(const std::string& identifier) const;
   bool systemGroupContainerIdIsWellknown(const std::string& identifier) const;
-  // NO for every class but 12 and 13.
+  // False for every class but 12 and 13.
   bool containerIdIsWellknown(const std::string& identifier,
                               TSYContainerClass containerClass) const;
   std::vector<std::string> wellknownSystemContainers() const;

@@ -5,6 +5,7 @@
 #include "Daemon/TSYMetadata.h"
 #include "Daemon/TSYUserIdentityCache.h"
 #include "Fuzz/FuzzDevice.h"
+#include "Platform/values/PropertyList.h"
 
 namespace {
 
@@ -20,9 +21,11 @@ TSYResult<TSYMetadata> read(const TSYURL& container) {
       container, TSYUserIdentityCache::defaultUserIdentity(), /*checkClassPath=*/true);
 }
 
+// Compared as bytes: a number that is none is not equal to itself.
 bool sameInfo(const TSYMetadata& left, const TSYMetadata& right) {
   if (!left.info() || !right.info()) return left.info() == right.info();
-  return *left.info() == *right.info();
+  return *platform::writeBinaryPropertyList(*left.info()) ==
+         *platform::writeBinaryPropertyList(*right.info());
 }
 
 void requireRoundTrip(const TSYMetadata& metadata, const TSYURL& container) {

@@ -34,7 +34,7 @@ std::string kernelPath(const std::string& path) {
 void makeLink(const FuzzDevice& device, const std::string& path, const std::string& text) {
   const auto place = device.files().locate(path);
   if (!place || text.empty()) return;
-  static_cast<void>(::symlinkat(text.c_str(), place->parent.get(), place->name.c_str()));
+  (void)::symlinkat(text.c_str(), place->parent.get(), place->name.c_str());
 }
 
 void ask(const std::string& base, const std::string& text) {
@@ -61,10 +61,10 @@ void run(const FuzzDevice& device, const std::string& line, std::string& base) {
   const size_t space = rest.find(' ');
   switch (line[0]) {
     case 'd':
-      static_cast<void>(device.files().makePath(treePath(device, rest), 0755));
+      (void)device.files().makePath(treePath(device, rest), 0755);
       break;
     case 'f':
-      static_cast<void>(device.files().writeFile(treePath(device, rest), {}, {}));
+      (void)device.files().writeFile(treePath(device, rest), {}, {});
       break;
     case 'l':
       if (space != std::string::npos) {
@@ -84,7 +84,7 @@ void run(const FuzzDevice& device, const std::string& line, std::string& base) {
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* bytes, size_t size) {
   static const FuzzDevice device;
   if (size > kLongestInput) return 0;
-  static_cast<void>(device.files().makePath(treePath(device, "base"), 0755));
+  (void)device.files().makePath(treePath(device, "base"), 0755);
   std::string base = treePath(device, "base");
   std::istringstream input(std::string(reinterpret_cast<const char*>(bytes), size));
   std::string line;

@@ -1,8 +1,6 @@
 #include "Platform/fs/AccessControl.h"
 
-#include <acl/libacl.h>
 #include <fcntl.h>
-#include <fmt/format.h>
 #include <sys/acl.h>
 #include <sys/stat.h>
 #include <sys/xattr.h>
@@ -11,6 +9,7 @@
 #include <span>
 
 #include "Platform/base/FileDescriptor.h"
+#include "Platform/fs/OpenBeneath.h"
 
 namespace platform {
 namespace {
@@ -82,10 +81,6 @@ ACLResult<ACL> build(std::span<const Entry> entries, gid_t group) {
   return owned;
 }
 
-std::string pathOfDescriptor(int descriptor) {
-  return fmt::format("/proc/self/fd/{}", descriptor);
-}
-
 ACLResult<void> apply(const std::string& path, acl_type_t type, std::span<const Entry> entries,
                       gid_t group) {
   const auto acl = build(entries, group);
@@ -105,7 +100,7 @@ ACLResult<void> setACL(int parent, const std::string& name, ACLShape shape, gid_
   if (S_ISDIR(status.st_mode) == isFileShape) {
     return std::unexpected(ACLFailure{{}, Errno{isFileShape ? EISDIR : ENOTDIR}, kNothing});
   }
-  const std::string path = pathOfDescriptor(item.get());
+  const std::string path = linkToDescriptor(item.get());
   const bool isTopLevel = shape == ACLShape::topLevelDirectory;
   const auto access = isTopLevel ? std::span<const Entry>(kTopLevelAccess) : kInnerAccess;
   const auto applied = apply(path, ACL_TYPE_ACCESS, access, group);

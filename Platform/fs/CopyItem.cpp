@@ -13,16 +13,12 @@
 #include <vector>
 
 #include "Platform/fs/OpenBeneath.h"
+#include "Platform/fs/PrivilegeRules.h"
 
 namespace platform {
 namespace {
 
 constexpr mode_t kPermissionBits = 07777;
-
-// A change of owner that the kernel refuses to somebody without root's rights is passed over.
-bool isOwnerRefused(Privilege privilege) {
-  return errno == EPERM && privilege == Privilege::none;
-}
 
 // --- Data ---------------------------------------------------------------------------------------
 
@@ -129,7 +125,7 @@ Result<void> copyAttribute(int source, int target, const std::string& name, Priv
 // What the target has inherited from its parent, a default ACL above all, is not the source's.
 Result<void> removeOtherAttributes(int target, const std::vector<std::string>& wanted) {
   const auto present = attributeNames(target);
-  if (!present) return failWith(present.error().value);
+  if (!present) return std::unexpected(present.error());
   for (const std::string& name : *present) {
     if (std::ranges::find(wanted, name) != wanted.end() || name.starts_with("security.")) continue;
     if (::fremovexattr(target, name.c_str()) != 0 && errno != ENODATA) return lastErrno();
@@ -139,7 +135,7 @@ Result<void> removeOtherAttributes(int target, const std::vector<std::string>& w
 
 Result<void> copyExtendedAttributes(int source, int target, Privilege privilege) {
   const auto names = attributeNames(source);
-  if (!names) return failWith(names.error().value);
+  if (!names) return std::unexpected(names.error());
   const auto removed = removeOtherAttributes(target, *names);
   if (!removed) return removed;
   for (const std::string& name : *names) {
@@ -165,7 +161,7 @@ Result<void> copyFIFO(int fifo, const struct stat& status, int target, const std
                       Privilege privilege) {
   if (::mkfifoat(target, newName.c_str(), S_IRUSR | S_IWUSR) != 0) return lastErrno();
   const auto copy = openBeneath(target, newName.c_str(), O_RDONLY | O_NONBLOCK);
-  if (!copy) return failWith(copy.error().value);
+  if (!copy) return std::unexpected(copy.error());
   return copyAttributes(fifo, status, copy->get(), privilege);
 }
 
@@ -176,10 +172,9 @@ Result<void> copyLink(int link, const struct stat& status, int target, const std
   if (length < 0) return lastErrno();
   const char* const name = newName.c_str();
   if (::symlinkat(text.data(), target, name) != 0) return lastErrno();
-  if (::fchownat(target, name, status.st_uid, status.st_gid, AT_SYMLINK_NOFOLLOW) != 0 &&
-      !isOwnerRefused(privilege)) {
-    return lastErrno();
-  }
+  const auto owned = ownerChanged(
+      ::fchownat(target, name, status.st_uid, status.st_gid, AT_SYMLINK_NOFOLLOW), privilege);
+  if (!owned) return owned;
   const std::array times{status.st_atim, status.st_mtim};
   if (::utimensat(target, name, times.data(), AT_SYMLINK_NOFOLLOW) != 0) return lastErrno();
   return {};
@@ -189,9 +184,8 @@ Result<void> copyLink(int link, const struct stat& status, int target, const std
 
 Result<void> copyAttributes(int source, const struct stat& status, int target,
                             Privilege privilege) {
-  if (::fchown(target, status.st_uid, status.st_gid) != 0 && !isOwnerRefused(privilege)) {
-    return lastErrno();
-  }
+  const auto owned = ownerChanged(::fchown(target, status.st_uid, status.st_gid), privilege);
+  if (!owned) return owned;
   if (::fchmod(target, status.st_mode & kPermissionBits) != 0) return lastErrno();
   const auto copied = copyExtendedAttributes(source, target, privilege);
   if (!copied) return copied;
@@ -203,7 +197,7 @@ Result<void> copyAttributes(int source, const struct stat& status, int target,
 Result<void> copyItem(int source, const std::string& name, int target, const std::string& newName,
                       Privilege privilege) {
   const auto look = openBeneath(source, name.c_str(), O_PATH | O_NOFOLLOW, Mounts::refuse);
-  if (!look) return failWith(look.error().value);
+  if (!look) return std::unexpected(look.error());
   struct stat status{};
   if (::fstat(look->get(), &status) != 0) return lastErrno();
   if (S_ISLNK(status.st_mode)) return copyLink(look->get(), status, target, newName, privilege);
@@ -212,7 +206,7 @@ Result<void> copyItem(int source, const std::string& name, int target, const std
 
   const auto item =
       openBeneath(source, name.c_str(), O_RDONLY | O_NONBLOCK | O_NOCTTY, Mounts::refuse);
-  if (!item) return failWith(item.error().value);
+  if (!item) return std::unexpected(item.error());
   if (::fstat(item->get(), &status) != 0) return lastErrno();
   if (S_ISREG(status.st_mode)) {
     return copyRegular(item->get(), status, target, newName, privilege);

@@ -37,7 +37,7 @@ Result<DirectoryStack::Identity> DirectoryStack::identify(int directory) {
 
 Result<void> DirectoryStack::close(Level& level) {
   const auto identity = identify(level.directory.get());
-  if (!identity) return failWith(identity.error().value);
+  if (!identity) return std::unexpected(identity.error());
   level.identity = *identity;
   level.entries = {};  // read again from `position` on the way back
   level.offset = 0;
@@ -62,7 +62,7 @@ Result<void> DirectoryStack::pop() {
       FileDescriptor directory(::openat(innermost(), "..", kUp));
       if (!directory.valid()) return lastErrno();
       const auto identity = identify(directory.get());
-      if (!identity) return failWith(identity.error().value);
+      if (!identity) return std::unexpected(identity.error());
       if (*identity != outer.identity) return failWith(ESTALE);
       if (::lseek(directory.get(), outer.position, SEEK_SET) < 0) return lastErrno();
       outer.directory = std::move(directory);
@@ -92,7 +92,7 @@ Result<std::optional<DirectoryStack::Entry>> DirectoryStack::next() {
   for (;;) {
     if (level.offset == level.entries.size()) {
       const auto filled = fill(level);
-      if (!filled) return failWith(filled.error().value);
+      if (!filled) return std::unexpected(filled.error());
       if (!*filled) return std::nullopt;
     }
     const char* const bytes = level.entries.data() + level.offset;

@@ -7,9 +7,11 @@
 #include <unistd.h>
 
 #include <array>
-#include <charconv>
 
+#include "Platform/base/WholeNumber.h"
 #include "Platform/fs/FileSystem.h"
+#include "Platform/fs/OpenBeneath.h"
+#include "Platform/fs/PrivilegeRules.h"
 
 namespace platform {
 namespace {
@@ -33,11 +35,7 @@ Result<std::optional<int>> markedClass(int descriptor, const char* attribute) {
     if (errno == ENODATA || errno == ENOTSUP || errno == ERANGE) return std::nullopt;
     return lastErrno();
   }
-  int value = 0;
-  const char* const end = text.data() + length;
-  const auto [rest, error] = std::from_chars(text.data(), end, value);
-  if (error != std::errc() || rest != end) return std::nullopt;
-  return value;
+  return wholeNumber<int>({text.data(), static_cast<size_t>(length)});
 }
 
 struct ClassOfItem {
@@ -47,17 +45,11 @@ struct ClassOfItem {
 
 Result<ClassOfItem> classOfItem(int descriptor, const char* attribute) {
   const auto marked = markedClass(descriptor, attribute);
-  if (!marked) return failWith(marked.error().value);
+  if (!marked) return std::unexpected(marked.error());
   struct stat status{};
   if (::fstat(descriptor, &status) != 0) return lastErrno();
   const int unmarked = S_ISDIR(status.st_mode) ? kClassOfUnmarkedDirectory : kClassOfUnmarkedFile;
   return ClassOfItem{marked->value_or(unmarked), S_ISREG(status.st_mode)};
-}
-
-// The kernel's answer to a change of owner, of which EPERM counts only with root's rights.
-Result<void> ownerChanged(int outcome, Privilege privilege) {
-  if (outcome == 0 || (errno == EPERM && privilege == Privilege::none)) return {};
-  return lastErrno();
 }
 
 }  // namespace
@@ -75,21 +67,21 @@ Result<void> FileSystem::setOwnerAt(int parent, const std::string& name, uid_t u
 }
 
 Result<void> FileSystem::setModeAt(int parent, const std::string& name, mode_t mode) const {
-  if (privilege_ == Privilege::none && mode == 0) mode = S_IRWXU;
-  if (::fchmodat(parent, name.c_str(), mode, AT_SYMLINK_NOFOLLOW) != 0) return lastErrno();
+  const mode_t applied = appliedMode(mode, privilege_);
+  if (::fchmodat(parent, name.c_str(), applied, AT_SYMLINK_NOFOLLOW) != 0) return lastErrno();
   return {};
 }
 
 Result<int> FileSystem::protectionClass(int descriptor) const {
   const auto item = classOfItem(descriptor, protectionClassAttribute(privilege_));
-  if (!item) return failWith(item.error().value);
+  if (!item) return std::unexpected(item.error());
   return item->value;
 }
 
 Result<void> FileSystem::setProtectionClass(int descriptor, int protectionClass) const {
   const char* const attribute = protectionClassAttribute(privilege_);
   const auto item = classOfItem(descriptor, attribute);
-  if (!item) return failWith(item.error().value);
+  if (!item) return std::unexpected(item.error());
   if (item->value == protectionClass) return {};
   const bool needsKey = item->value == kClassComplete || protectionClass == kClassComplete;
   if (item->isRegular && needsKey && isLocked_ && isLocked_()) return failWith(EPERM);
@@ -106,7 +98,7 @@ Result<bool> FileSystem::clearImmutableAt(int parent, const std::string& name) c
   struct stat status{};
   if (!item.valid() || ::fstat(item.get(), &status) != 0) return lastErrno();
   if (!S_ISREG(status.st_mode) && !S_ISDIR(status.st_mode)) return false;
-  const std::string itself = fmt::format("/proc/self/fd/{}", item.get());
+  const std::string itself = linkToDescriptor(item.get());
   const FileDescriptor open(::open(itself.c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC));
   if (!open.valid()) return lastErrno();
 

@@ -17,10 +17,6 @@
 namespace platform {
 namespace {
 
-constexpr int kReadDirectory = O_RDONLY | O_DIRECTORY;
-// How often a name may change between a directory and something else under our hands.
-constexpr int kSwaps = 16;
-
 class TreeCopy {
  public:
   explicit TreeCopy(Privilege privilege) : privilege_(privilege) {}
@@ -35,7 +31,7 @@ class TreeCopy {
  private:
   Result<void> step() {
     const auto entry = sources_.next();
-    if (!entry) return failWith(entry.error().value);
+    if (!entry) return std::unexpected(entry.error());
     if (!*entry) return leave();
     const std::string name = (*entry)->name;
     const auto copied = copyEntry(sources_.innermost(), name, targets_.innermost(), name,
@@ -54,8 +50,7 @@ class TreeCopy {
       if (mayBeDirectory) {
         auto directory = openBeneath(source, name.c_str(), kReadDirectory, mounts);
         if (directory) return enter(std::move(*directory), target, newName);
-        const int error = directory.error().value;
-        if (error != ENOTDIR && error != ELOOP) return failWith(error);
+        if (!isNoDirectory(directory.error())) return std::unexpected(directory.error());
       }
       const auto copied = copyItem(source, name, target, newName, privilege_);
       if (copied || copied.error().value != EISDIR) return copied;
@@ -69,7 +64,7 @@ class TreeCopy {
     if (::fstat(directory.get(), &status) != 0) return lastErrno();
     if (::mkdirat(target, newName.c_str(), S_IRWXU) != 0) return lastErrno();
     auto copy = openBeneath(target, newName.c_str(), kReadDirectory, Mounts::refuse);
-    if (!copy) return failWith(copy.error().value);
+    if (!copy) return std::unexpected(copy.error());
     statuses_.push_back(status);
     const auto pushed = targets_.push(std::move(*copy));
     if (!pushed) return pushed;
@@ -96,12 +91,12 @@ class TreeCopy {
 // Brings the finished copy to disk.
 Result<void> sync(int parent, const std::string& name) {
   const auto item = openBeneath(parent, name.c_str(), O_PATH | O_NOFOLLOW, Mounts::refuse);
-  if (!item) return failWith(item.error().value);
+  if (!item) return std::unexpected(item.error());
   struct stat status{};
   if (::fstat(item->get(), &status) != 0) return lastErrno();
   if (!S_ISREG(status.st_mode) && !S_ISDIR(status.st_mode)) return {};
   const auto open = openBeneath(parent, name.c_str(), O_RDONLY | O_NONBLOCK, Mounts::refuse);
-  if (!open) return failWith(open.error().value);
+  if (!open) return std::unexpected(open.error());
   const int synced = S_ISDIR(status.st_mode) ? ::syncfs(open->get()) : ::fsync(open->get());
   if (synced != 0) return lastErrno();
   return {};
@@ -123,15 +118,15 @@ Result<void> copyIntoPlace(const Place& source, const Place& target, const std::
 Result<void> FileSystem::copy(const std::string& from, const std::string& to) const {
   if (to.starts_with(from + '/')) return failWith(EINVAL);  // a tree into itself
   const auto source = locate(from);
-  if (!source) return failWith(source.error().value);
+  if (!source) return std::unexpected(source.error());
   const auto target = locate(to);
-  if (!target) return failWith(target.error().value);
+  if (!target) return std::unexpected(target.error());
   const auto temporary = temporarySiblingName();
-  if (!temporary) return failWith(temporary.error().value);
+  if (!temporary) return std::unexpected(temporary.error());
   auto result = copyIntoPlace(*source, *target, *temporary, privilege_);
   if (!result) {
     const std::string rest = to.substr(0, to.rfind('/') + 1) + *temporary;
-    static_cast<void>(remove(rest, nullptr));  // the copy's own error is the one that counts
+    (void)remove(rest, nullptr);  // the copy's own error is the one that counts
   }
   return result;
 }

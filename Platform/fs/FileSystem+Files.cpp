@@ -4,7 +4,6 @@
 #include <unistd.h>
 
 #include "Platform/fs/FileSystem.h"
-#include "Platform/fs/OpenBeneath.h"
 #include "Platform/fs/RandomName.h"
 
 namespace platform {
@@ -50,7 +49,7 @@ Result<std::vector<uint8_t>> FileSystem::readFile(const std::string& path, size_
   if (size > limit) return failWith(EFBIG);
   std::vector<uint8_t> bytes(size);
   const auto read = readInto(file->get(), bytes);
-  if (!read) return failWith(read.error().value);
+  if (!read) return std::unexpected(read.error());
   return bytes;
 }
 
@@ -74,14 +73,14 @@ Result<void> FileSystem::createFileAt(int parent, const std::string& name,
 Result<void> FileSystem::writeFile(const std::string& path, std::span<const uint8_t> bytes,
                                    const WriteOptions& options) const {
   const auto place = locate(path);
-  if (!place) return failWith(place.error().value);
+  if (!place) return std::unexpected(place.error());
   const int parent = place->parent.get();
   if (!options.atomic) {
     if (::unlinkat(parent, place->name.c_str(), 0) != 0 && errno != ENOENT) return lastErrno();
     return createFileAt(parent, place->name, bytes, options);
   }
   const auto temporary = temporarySiblingName();
-  if (!temporary) return failWith(temporary.error().value);
+  if (!temporary) return std::unexpected(temporary.error());
   const auto created = createFileAt(parent, *temporary, bytes, options);
   if (!created) return created;
   if (::renameat(parent, temporary->c_str(), parent, place->name.c_str()) != 0) {

@@ -1,6 +1,5 @@
 // The two operations that follow links. The kernel does it, confined to the root's tree.
 #include <fcntl.h>
-#include <fmt/format.h>
 #include <unistd.h>
 
 #include <array>
@@ -23,28 +22,28 @@ bool isSameItem(int first, int second) {
 
 Result<std::string> FileSystem::resolve(const std::string& path) const {
   const auto relativePath = relativeWithDots(path);
-  if (!relativePath) return failWith(relativePath.error().value);
+  if (!relativePath) return std::unexpected(relativePath.error());
   const auto item = lookInside(rootDescriptor_.get(), *relativePath, FinalLink::follow);
-  if (!item) return failWith(item.error().value);
-  const std::string magicLink = fmt::format("/proc/self/fd/{}", item->get());
+  if (!item) return std::unexpected(item.error());
+  const std::string link = linkToDescriptor(item->get());
   std::array<char, PATH_MAX> text{};
-  const ssize_t length = ::readlink(magicLink.c_str(), text.data(), text.size());
+  const ssize_t length = ::readlink(link.c_str(), text.data(), text.size());
   if (length < 0) return lastErrno();
   if (static_cast<size_t>(length) == text.size()) return failWith(ENAMETOOLONG);
   std::string resolved(text.data(), static_cast<size_t>(length));
   // The kernel marks an item that was removed meanwhile in the text itself, and one that was moved
   // may be elsewhere by now: the text counts only when it leads to the item again.
   const auto again = openAt(resolved, O_PATH | O_NOFOLLOW);
-  if (!again) return failWith(again.error().value);
+  if (!again) return std::unexpected(again.error());
   if (!isSameItem(item->get(), again->get())) return failWith(ENOENT);
   return resolved;
 }
 
 Result<std::string> FileSystem::readLink(const std::string& path) const {
   const auto relativePath = relativeWithDots(path);
-  if (!relativePath) return failWith(relativePath.error().value);
+  if (!relativePath) return std::unexpected(relativePath.error());
   const auto item = lookInside(rootDescriptor_.get(), *relativePath, FinalLink::open);
-  if (!item) return failWith(item.error().value);
+  if (!item) return std::unexpected(item.error());
   struct stat status{};
   if (::fstat(item->get(), &status) != 0) return lastErrno();
   if (!S_ISLNK(status.st_mode)) return failWith(EINVAL);

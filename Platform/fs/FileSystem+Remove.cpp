@@ -14,8 +14,6 @@
 namespace platform {
 namespace {
 
-// How often a name may change between a directory and something else under our hands.
-constexpr int kSwaps = 16;
 // How often a directory is emptied again when somebody keeps filling it.
 constexpr int kEmptyings = 16;
 
@@ -59,8 +57,7 @@ class Removal {
     for (int swap = 0; swap < kSwaps; ++swap) {
       const bool done = isDirectory ? enter(parent, name) : unlink(parent, name, 0);
       if (done) return true;
-      const bool isOther = isDirectory ? error_ == Errno{ENOTDIR} || error_ == Errno{ELOOP}
-                                       : error_ == Errno{EISDIR};
+      const bool isOther = isDirectory ? isNoDirectory(error_) : error_ == Errno{EISDIR};
       if (!isOther) return false;
       isDirectory = !isDirectory;
     }
@@ -74,7 +71,7 @@ class Removal {
   }
 
   bool enter(int parent, const char* name) {
-    auto directory = openBeneath(parent, name, O_RDONLY | O_DIRECTORY, Mounts::refuse);
+    auto directory = openBeneath(parent, name, kReadDirectory, Mounts::refuse);
     if (!directory) {
       error_ = directory.error();
       return error_ == Errno{ENOENT};
@@ -149,7 +146,7 @@ Result<void> FileSystem::remove(const std::string& path, const RemovalFailure& o
   const auto place = locate(path);
   if (!place) {
     if (place.error().value == ENOENT) return {};
-    return failWith(place.error().value);
+    return std::unexpected(place.error());
   }
   return Removal(path, onFailure).run(place->parent.get(), place->name);
 }

@@ -5,7 +5,6 @@
 // is whatever is mounted inside: it is no part of the tree.
 #include <fcntl.h>
 #include <sys/sysmacros.h>
-#include <unistd.h>
 
 #include <set>
 #include <utility>
@@ -16,9 +15,6 @@
 
 namespace platform {
 namespace {
-
-// How often a name may change between a directory and something else under our hands.
-constexpr int kSwaps = 16;
 
 struct stat statusFrom(const struct statx& from) {
   const auto time = [](const statx_timestamp& stamp) {
@@ -41,11 +37,6 @@ struct stat statusFrom(const struct statx& from) {
   return status;
 }
 
-// Whether opening a directory has found something else.
-bool isNoDirectory(Errno error) {
-  return error == Errno{ENOTDIR} || error == Errno{ELOOP};
-}
-
 // lstat(2) of an entry; EXDEV when something is mounted on it. Whoever serves that mount is not
 // asked for anything.
 Result<struct stat> statusOfEntry(int parent, const char* name) {
@@ -66,7 +57,7 @@ class Walk {
     rootName_ = name;
     auto goesOn = visitRoot();
     while (goesOn && *goesOn && !stack_.isEmpty()) goesOn = step();
-    if (!goesOn) return failWith(goesOn.error().value);
+    if (!goesOn) return std::unexpected(goesOn.error());
     return {};
   }
 
@@ -81,13 +72,13 @@ class Walk {
     const auto entered = enter(rootParent_, rootName_.c_str(), Mounts::cross);
     if (entered || !isNoDirectory(entered.error())) return entered;
     const auto status = statusOfEntry(rootParent_, rootName_.c_str());
-    if (!status) return failWith(status.error().value);
+    if (!status) return std::unexpected(status.error());
     return visit(rootParent_, *status, FileSystem::Visit::item);
   }
 
   Result<bool> step() {
     const auto entry = stack_.next();
-    if (!entry) return failWith(entry.error().value);
+    if (!entry) return std::unexpected(entry.error());
     if (!*entry) return leave();
     name_ = (*entry)->name;
     const size_t length = path_.size();
@@ -108,11 +99,10 @@ class Walk {
     for (int swap = 0; swap < kSwaps; ++swap) {
       if (mayBeDirectory) {
         const auto entered = enter(parent, name_.c_str(), Mounts::refuse);
-        if (entered) return entered;
-        if (!isNoDirectory(entered.error())) return entered;
+        if (entered || !isNoDirectory(entered.error())) return entered;
       }
       const auto status = statusOfEntry(parent, name_.c_str());
-      if (!status) return failWith(status.error().value);
+      if (!status) return std::unexpected(status.error());
       if (!S_ISDIR(status->st_mode)) return visit(parent, *status, FileSystem::Visit::item);
       mayBeDirectory = true;
     }
@@ -120,21 +110,21 @@ class Walk {
   }
 
   Result<bool> enter(int parent, const char* name, Mounts mounts) {
-    auto directory = openBeneath(parent, name, O_RDONLY | O_DIRECTORY, mounts);
-    if (!directory) return failWith(directory.error().value);
+    auto directory = openBeneath(parent, name, kReadDirectory, mounts);
+    if (!directory) return std::unexpected(directory.error());
     Level level{path_.size() - (stack_.isEmpty() ? 0 : name_.size() + 1), {}};
     if (::fstat(directory->get(), &level.status) != 0) return lastErrno();
     const auto goesOn = visit(parent, level.status, FileSystem::Visit::directoryBefore);
     if (!goesOn || !*goesOn) return goesOn;
     levels_.push_back(level);
     const auto pushed = stack_.push(std::move(*directory));
-    if (!pushed) return failWith(pushed.error().value);
+    if (!pushed) return std::unexpected(pushed.error());
     return true;
   }
 
   Result<bool> leave() {
     const auto popped = stack_.pop();
-    if (!popped) return failWith(popped.error().value);
+    if (!popped) return std::unexpected(popped.error());
     const Level left = levels_.back();
     levels_.pop_back();
     const bool isRoot = stack_.isEmpty();
@@ -162,7 +152,7 @@ class Walk {
 
 Result<void> FileSystem::walk(const std::string& path, const Visitor& visitor) const {
   const auto place = locate(path);
-  if (!place) return failWith(place.error().value);
+  if (!place) return std::unexpected(place.error());
   return Walk(path, visitor).run(place->parent.get(), place->name);
 }
 
@@ -179,7 +169,7 @@ Result<FileSystem::TreeSize> FileSystem::measure(const std::string& path) const 
     }
     return true;
   });
-  if (!walked) return failWith(walked.error().value);
+  if (!walked) return std::unexpected(walked.error());
   return size;
 }
 

@@ -8,18 +8,18 @@
 #include <fcntl.h>
 #include <unistd.h>
 
-#include <climits>
+#include <algorithm>
 #include <cstdlib>
 #include <string_view>
 
 #include "Platform/fs/AccessControl.h"
 #include "Platform/fs/OpenBeneath.h"
+#include "Platform/fs/PrivilegeRules.h"
 #include "Platform/fs/RandomName.h"
 
 namespace platform {
 namespace {
 
-constexpr int kReadDirectory = O_RDONLY | O_DIRECTORY;
 // A descriptor to work from with the ...at() calls: needs no right to read the directory.
 constexpr int kReachDirectory = O_PATH | O_DIRECTORY;
 constexpr int kReachItem = O_PATH | O_NOFOLLOW;
@@ -68,7 +68,7 @@ std::optional<ItemKind> kindOfEntry(int directory, const dirent& entry) {
 // default ACL have made of it.
 Result<void> finishDirectory(int parent, const std::string& name, mode_t mode) {
   const auto directory = openBeneath(parent, name.c_str(), kReadDirectory);
-  if (!directory) return failWith(directory.error().value);
+  if (!directory) return std::unexpected(directory.error());
   struct stat status{};
   if (::fstat(directory->get(), &status) != 0) return lastErrno();
   if ((status.st_mode & kPermissionBits) != mode && ::fchmod(directory->get(), mode) != 0) {
@@ -79,9 +79,9 @@ Result<void> finishDirectory(int parent, const std::string& name, mode_t mode) {
 
 Result<void> makeDirectoryAt(int parent, const std::string& name, mode_t mode,
                              Privilege privilege) {
-  if (privilege == Privilege::none && mode == 0) mode = S_IRWXU;
-  if (::mkdirat(parent, name.c_str(), mode) != 0) return lastErrno();
-  return finishDirectory(parent, name, mode);
+  const mode_t applied = appliedMode(mode, privilege);
+  if (::mkdirat(parent, name.c_str(), applied) != 0) return lastErrno();
+  return finishDirectory(parent, name, applied);
 }
 
 }  // namespace
@@ -122,20 +122,20 @@ Result<const char*> FileSystem::relative(const std::string& path) const {
 
 Result<FileDescriptor> FileSystem::openAt(const std::string& path, int flags) const {
   const auto relativePath = relative(path);
-  if (!relativePath) return failWith(relativePath.error().value);
+  if (!relativePath) return std::unexpected(relativePath.error());
   return openBeneath(rootDescriptor_.get(), *relativePath, flags);
 }
 
 Result<Place> FileSystem::locate(const std::string& path) const {
   const auto relativePath = relative(path);
-  if (!relativePath) return failWith(relativePath.error().value);
+  if (!relativePath) return std::unexpected(relativePath.error());
   std::string_view rest = *relativePath;
   while (rest.ends_with('/')) rest.remove_suffix(1);
   if (rest == ".") return failWith(EINVAL);
   const size_t slash = rest.rfind('/');
   const std::string parent(slash == std::string_view::npos ? "." : rest.substr(0, slash));
   auto descriptor = openBeneath(rootDescriptor_.get(), parent.c_str(), kReachDirectory);
-  if (!descriptor) return failWith(descriptor.error().value);
+  if (!descriptor) return std::unexpected(descriptor.error());
   return Place{std::move(*descriptor), std::string(rest.substr(slash + 1))};
 }
 
@@ -149,13 +149,13 @@ Result<FileDescriptor> FileSystem::openItem(const std::string& path) const {
 
 Result<void> FileSystem::exists(const std::string& path) const {
   const auto item = openAt(path, kReachItem);
-  if (!item) return failWith(item.error().value);
+  if (!item) return std::unexpected(item.error());
   return {};
 }
 
 Result<struct stat> FileSystem::status(const std::string& path) const {
   const auto item = openAt(path, kReachItem);
-  if (!item) return failWith(item.error().value);
+  if (!item) return std::unexpected(item.error());
   struct stat status{};
   if (::fstat(item->get(), &status) != 0) return lastErrno();
   return status;
@@ -163,7 +163,7 @@ Result<struct stat> FileSystem::status(const std::string& path) const {
 
 Result<std::vector<DirectoryEntry>> FileSystem::list(const std::string& directory) const {
   auto descriptor = openDirectory(directory);
-  if (!descriptor) return failWith(descriptor.error().value);
+  if (!descriptor) return std::unexpected(descriptor.error());
   const std::unique_ptr<DIR, CloseStream> stream(::fdopendir(descriptor->get()));
   if (!stream) return lastErrno();
   const int number = descriptor->release();
@@ -174,8 +174,8 @@ Result<std::vector<DirectoryEntry>> FileSystem::list(const std::string& director
     if (entry == nullptr) break;
     const std::string_view name = entry->d_name;
     if (name == "." || name == "..") continue;
-    if (const auto kind = kindOfEntry(number, *entry))
-      entries.push_back({std::string(name), *kind});
+    const auto kind = kindOfEntry(number, *entry);
+    if (kind) entries.push_back({std::string(name), *kind});
   }
   if (errno != 0) return lastErrno();
   return entries;
@@ -183,7 +183,7 @@ Result<std::vector<DirectoryEntry>> FileSystem::list(const std::string& director
 
 Result<void> FileSystem::syncDirectory(const std::string& path) const {
   const auto directory = openDirectory(path);
-  if (!directory) return failWith(directory.error().value);
+  if (!directory) return std::unexpected(directory.error());
   if (::fsync(directory->get()) != 0) return lastErrno();
   return {};
 }
@@ -192,16 +192,16 @@ Result<void> FileSystem::syncDirectory(const std::string& path) const {
 
 Result<void> FileSystem::makeDirectory(const std::string& path, mode_t mode) const {
   const auto place = locate(path);
-  if (!place) return failWith(place.error().value);
+  if (!place) return std::unexpected(place.error());
   return makeDirectoryAt(place->parent.get(), place->name, mode, privilege_);
 }
 
 Result<void> FileSystem::makePath(const std::string& path, mode_t mode) const {
   const auto relativePath = relative(path);
-  if (!relativePath) return failWith(relativePath.error().value);
+  if (!relativePath) return std::unexpected(relativePath.error());
   auto directory = openBeneath(rootDescriptor_.get(), *relativePath, kReachDirectory);
   if (directory) return {};
-  if (directory.error().value != ENOENT) return failWith(directory.error().value);
+  if (directory.error().value != ENOENT) return std::unexpected(directory.error());
 
   std::string_view rest = *relativePath;
   FileDescriptor parent;  // the root's own until the first component is open
@@ -217,7 +217,7 @@ Result<void> FileSystem::makePath(const std::string& path, mode_t mode) const {
       if (!made && made.error().value != EEXIST) return made;
       directory = openBeneath(from, component.c_str(), kReachDirectory);
     }
-    if (!directory) return failWith(directory.error().value);
+    if (!directory) return std::unexpected(directory.error());
     parent = std::move(*directory);
   }
   return {};
@@ -229,23 +229,23 @@ Result<std::string> FileSystem::makeTemporaryDirectory(const std::string& parent
   if (prefix.find('/') != std::string::npos) return failWith(EINVAL);
   for (int attempt = 1;; ++attempt) {
     const auto name = randomName(prefix, kRandomCharacters);
-    if (!name) return failWith(name.error().value);
+    if (!name) return std::unexpected(name.error());
     std::string path = parent;
     if (!path.ends_with('/')) path += '/';
     path += *name;
     const auto made = makeDirectory(path, S_IRWXU);
     if (made) return path;
     if (made.error().value != EEXIST || attempt == kNameAttempts) {
-      return failWith(made.error().value);
+      return std::unexpected(made.error());
     }
   }
 }
 
 Result<void> FileSystem::rename(const std::string& from, const std::string& to) const {
   const auto source = locate(from);
-  if (!source) return failWith(source.error().value);
+  if (!source) return std::unexpected(source.error());
   const auto target = locate(to);
-  if (!target) return failWith(target.error().value);
+  if (!target) return std::unexpected(target.error());
   if (::renameat(source->parent.get(), source->name.c_str(), target->parent.get(),
                  target->name.c_str()) != 0) {
     return lastErrno();

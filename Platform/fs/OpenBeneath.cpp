@@ -1,6 +1,6 @@
 #include "Platform/fs/OpenBeneath.h"
 
-#include <fcntl.h>
+#include <fmt/format.h>
 #include <linux/openat2.h>
 #include <sys/syscall.h>
 #include <unistd.h>
@@ -34,6 +34,10 @@ Result<FileDescriptor> openBeneath(int directory, const char* path, int flags, M
 Result<FileDescriptor> lookInside(int directory, const char* path, FinalLink finalLink) {
   const int flags = O_PATH | (finalLink == FinalLink::open ? O_NOFOLLOW : 0);
   return openResolving(directory, path, flags, RESOLVE_IN_ROOT | RESOLVE_NO_MAGICLINKS);
+}
+
+std::string linkToDescriptor(int descriptor) {
+  return fmt::format("/proc/self/fd/{}", descriptor);
 }
 
 }  // namespace platform

@@ -2,12 +2,11 @@
 
 #include <grp.h>
 #include <pwd.h>
-#include <unistd.h>
 
 #include <algorithm>
-#include <charconv>
 #include <limits>
 
+#include "Platform/base/WholeNumber.h"
 #include "Platform/os/OpenFile.h"
 #include "Platform/os/PlatformLog.h"
 
@@ -27,12 +26,9 @@ std::vector<std::string_view> split(std::string_view text, char separator) {
 }
 
 // (uint32_t)-1 means "leave it" to chown(2) and setuid(2): it is nobody's number.
-std::optional<uint32_t> numberFromText(std::string_view text) {
-  uint32_t number = 0;
-  const auto parsed = std::from_chars(text.data(), text.data() + text.size(), number);
-  if (parsed.ec != std::errc() || parsed.ptr != text.data() + text.size()) return std::nullopt;
-  if (number == std::numeric_limits<uint32_t>::max()) return std::nullopt;
-  return number;
+std::optional<uint32_t> idFromText(std::string_view text) {
+  const auto number = wholeNumber<uint32_t>(text);
+  return number == std::numeric_limits<uint32_t>::max() ? std::nullopt : number;
 }
 
 std::string homeUnderRoot(const std::string& root, std::string_view home) {
@@ -44,8 +40,8 @@ std::string homeUnderRoot(const std::string& root, std::string_view home) {
 std::optional<Account> accountFromLine(std::string_view line, const std::string& root) {
   const auto fields = split(line, ':');
   if (fields.size() != 7 || fields[0].empty() || !fields[5].starts_with('/')) return std::nullopt;
-  const auto uid = numberFromText(fields[2]);
-  const auto gid = numberFromText(fields[3]);
+  const auto uid = idFromText(fields[2]);
+  const auto gid = idFromText(fields[3]);
   if (!uid || !gid) return std::nullopt;
   return Account{std::string(fields[0]), *uid, *gid, homeUnderRoot(root, fields[5])};
 }
@@ -54,13 +50,29 @@ std::optional<Account> accountFromLine(std::string_view line, const std::string&
 std::optional<Group> groupFromLine(std::string_view line) {
   const auto fields = split(line, ':');
   if (fields.size() != 4 || fields[0].empty()) return std::nullopt;
-  const auto gid = numberFromText(fields[2]);
+  const auto gid = idFromText(fields[2]);
   if (!gid) return std::nullopt;
   Group group{std::string(fields[0]), *gid, {}};
   for (const std::string_view member : split(fields[3], ',')) {
     if (!member.empty()) group.members.emplace_back(member);
   }
   return group;
+}
+
+// A file as it was when it was read.
+struct ReadFile {
+  std::vector<uint8_t> bytes;
+  struct stat status;
+};
+
+Result<ReadFile> readRegularFile(const FileSystem& files, const std::string& path) {
+  const auto file = files.openItem(path);
+  if (!file) return std::unexpected(file.error());
+  struct stat status{};
+  if (::fstat(file->get(), &status) != 0 || !S_ISREG(status.st_mode)) return failWith(EINVAL);
+  auto bytes = readToEnd(file->get(), kLongestFile);
+  if (!bytes) return std::unexpected(bytes.error());
+  return ReadFile{*std::move(bytes), status};
 }
 
 // Malformed lines are passed over, as the C library does.
@@ -130,22 +142,18 @@ const std::vector<Entry>* Accounts::refresh(Database<Entry>& database, const cha
   const auto status = files_.status(path);
   if (!status && status.error().value == ENOENT) return nullptr;
   if (status && database.stamp == Stamp(*status)) return &database.entries;
-  const auto file = files_.openItem(path);
-  struct stat opened{};
-  const bool isRegular = file && ::fstat(file->get(), &opened) == 0 && S_ISREG(opened.st_mode);
-  const auto bytes = isRegular ? readToEnd(file->get(), kLongestFile)
-                               : Result<std::vector<uint8_t>>(failWith(EINVAL));
-  if (!bytes) {
+  const auto file = readRegularFile(files_, path);
+  if (!file) {
     // What was good last stays, and reading is tried again: one line in the log for each state.
     if (!status || database.unreadable != Stamp(*status)) {
       platformLog(LogLevel::error, "Accounts::refresh", "{} cannot be read: {}", path,
-                  file ? bytes.error().message() : file.error().message());
+                  file.error().message());
     }
     if (status) database.unreadable = Stamp(*status);
     return &database.entries;
   }
-  database.entries = parse<Entry>(asText(*bytes), path, fromLine);
-  database.stamp = Stamp(opened);
+  database.entries = parse<Entry>(asText(file->bytes), path, fromLine);
+  database.stamp = Stamp(file->status);
   return &database.entries;
 }
 

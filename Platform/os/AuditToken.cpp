@@ -3,10 +3,10 @@
 #include <fcntl.h>
 #include <fmt/core.h>
 
-#include <charconv>
 #include <string_view>
 
 #include "Platform/base/FileDescriptor.h"
+#include "Platform/base/WholeNumber.h"
 #include "Platform/os/OpenFile.h"
 
 namespace platform {
@@ -51,11 +51,9 @@ Result<uint64_t> processStartTime(pid_t pid) {
   if (!file.valid()) return failWith(errno == ENOENT ? ESRCH : errno);
   const auto stat = readToEnd(file.get(), kLongestStat);
   if (!stat) return std::unexpected(stat.error());
-  const std::string_view field = fieldOfStat(asText(*stat), kStartTimeField);
-  uint64_t startTime = 0;
-  const auto parsed = std::from_chars(field.data(), field.data() + field.size(), startTime);
-  if (parsed.ec != std::errc() || parsed.ptr != field.data() + field.size()) return failWith(EIO);
-  return startTime;
+  const auto startTime = wholeNumber<uint64_t>(fieldOfStat(asText(*stat), kStartTimeField));
+  if (!startTime) return failWith(EIO);
+  return *startTime;
 }
 
 }  // namespace platform

@@ -2,8 +2,9 @@
 
 #include <fmt/format.h>
 
-#include <charconv>
+#include <algorithm>
 
+#include "Platform/base/WholeNumber.h"
 #include "Platform/os/OpenFile.h"
 #include "Platform/os/PlatformLog.h"
 #include "Platform/values/PropertyList.h"
@@ -43,7 +44,7 @@ Value::Dictionary readConfigurationDictionary(const FileSystem& files, const std
   auto value = readConfigurationFile(files, path);
   if (!value) return {};
   if (value->asDictionary() != nullptr) return std::move(*value->asDictionary());
-  static_cast<void>(malformed(path, fmt::format("no dictionary: {}", value->typeName())));
+  (void)malformed(path, fmt::format("no dictionary: {}", value->typeName()));
   return {};
 }
 
@@ -52,18 +53,25 @@ Result<uint64_t> readNumberFile(const FileSystem& files, const std::string& path
   if (!bytes) return std::unexpected(bytes.error());
   std::string_view text = asText(*bytes);
   if (text.ends_with('\n')) text.remove_suffix(1);
-  uint64_t number = 0;
-  const auto parsed = std::from_chars(text.data(), text.data() + text.size(), number);
-  if (parsed.ec != std::errc() || parsed.ptr != text.data() + text.size()) {
-    return malformed(path, "not one decimal number");
-  }
-  return number;
+  const auto number = wholeNumber<uint64_t>(text);
+  if (!number) return malformed(path, "not one decimal number");
+  return *number;
 }
 
 Result<void> writeNumberFile(const FileSystem& files, const std::string& path, uint64_t number) {
   const std::string text = fmt::format("{}\n", number);
-  return files.writeFile(path, {reinterpret_cast<const uint8_t*>(text.data()), text.size()},
-                         {.mode = 0644, .protectionClass = {}, .atomic = true});
+  return files.writeFile(path, asBytes(text), {.atomic = true});
+}
+
+bool isPathOfNames(std::string_view path) {
+  if (path.find('\0') != std::string_view::npos) return false;
+  for (;;) {
+    const size_t length = std::min(path.find('/'), path.size());
+    const std::string_view component = path.substr(0, length);
+    if (component.empty() || component == "." || component == "..") return false;
+    if (length == path.size()) return true;
+    path.remove_prefix(length + 1);
+  }
 }
 
 }  // namespace platform

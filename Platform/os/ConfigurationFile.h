@@ -4,6 +4,7 @@
 
 #include <cstdint>
 #include <string>
+#include <string_view>
 
 #include "Platform/fs/FileSystem.h"
 #include "Platform/values/Value.h"
@@ -20,5 +21,9 @@ Value::Dictionary readConfigurationDictionary(const FileSystem& files, const std
 Result<uint64_t> readNumberFile(const FileSystem& files, const std::string& path);
 // Replaces it atomically.
 Result<void> writeNumberFile(const FileSystem& files, const std::string& path, uint64_t number);
+
+// Whether a relative path that such a file holds stays below where it starts: every component is a
+// name, none of them empty, "." or "..", and no NUL is in it.
+bool isPathOfNames(std::string_view path);
 
 }  // namespace platform

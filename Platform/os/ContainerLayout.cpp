@@ -1,9 +1,8 @@
 #include "Platform/os/ContainerLayout.h"
 
-#include <charconv>
-#include <optional>
 #include <set>
 
+#include "Platform/base/WholeNumber.h"
 #include "Platform/os/ConfigurationFile.h"
 #include "Platform/os/PlatformLog.h"
 #include "Platform/os/RuntimeDirectory.h"
@@ -27,18 +26,6 @@ std::map<uint64_t, Layout> ownTable() {
   };
 }
 
-// Whether the path stays inside the container: relative, and every component a name.
-bool isSafe(std::string_view path) {
-  if (path.find('\0') != std::string_view::npos) return false;
-  for (;;) {
-    const size_t length = std::min(path.find('/'), path.size());
-    const std::string_view component = path.substr(0, length);
-    if (component.empty() || component == "." || component == "..") return false;
-    if (length == path.size()) return true;
-    path.remove_prefix(length + 1);
-  }
-}
-
 // In order, a path comes after what it begins with: parents, which are added where they are not
 // listed, stand before their children.
 Layout layoutFromValue(const Value& value) {
@@ -46,7 +33,7 @@ Layout layoutFromValue(const Value& value) {
   std::set<std::string> paths;
   for (const Value& item : *value.asArray()) {
     const std::string* path = item.asString();
-    if (path == nullptr || !isSafe(*path)) {
+    if (path == nullptr || !isPathOfNames(*path)) {
       return std::unexpected(ContainerLayout::kUnknownClass);
     }
     for (size_t slash = path->find('/'); slash != std::string::npos;
@@ -58,19 +45,12 @@ Layout layoutFromValue(const Value& value) {
   return std::vector<std::string>(paths.begin(), paths.end());
 }
 
-std::optional<uint64_t> classFromKey(const std::string& key) {
-  uint64_t containerClass = 0;
-  const auto parsed = std::from_chars(key.data(), key.data() + key.size(), containerClass);
-  if (parsed.ec != std::errc() || parsed.ptr != key.data() + key.size()) return std::nullopt;
-  return containerClass;
-}
-
 }  // namespace
 
 ContainerLayout::ContainerLayout(const FileSystem& files) : layouts_(ownTable()) {
   const std::string path = configurationDirectory(files) + "/container-layout.plist";
   for (const auto& [key, value] : readConfigurationDictionary(files, path)) {
-    const auto containerClass = classFromKey(key);
+    const auto containerClass = wholeNumber<uint64_t>(key);
     const Layout layout = layoutFromValue(value);
     if (!containerClass || !layout) {
       platformLog(LogLevel::error, "ContainerLayout::ContainerLayout",

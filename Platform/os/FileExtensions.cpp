@@ -71,8 +71,8 @@ Result<FileExtensions::Key> FileExtensions::key() const {
     }
     stored.emplace();
     randombytes_buf(stored->data(), stored->size());
-    const auto written = files_.writeFile(
-        keyPath(files_), *stored, {.mode = kKeyMode, .protectionClass = {}, .atomic = true});
+    const auto written =
+        files_.writeFile(keyPath(files_), *stored, {.mode = kKeyMode, .atomic = true});
     if (!written) return std::unexpected(written.error());
   }
   key_ = *stored;
@@ -91,11 +91,8 @@ Result<std::string> FileExtensions::issue(const std::string& extensionClass,
   const auto message = statement(extensionClass, path, process);
   Authenticator authenticator{};
   crypto_auth(authenticator.data(), message.data(), message.size(), secret->data());
-  std::string token = fmt::format("{};{};{};", extensionClass, process.pid(), path);
-  for (const unsigned char byte : authenticator) {
-    fmt::format_to(std::back_inserter(token), "{:02x}", byte);
-  }
-  return token;
+  return fmt::format("{};{};{};{:02x}", extensionClass, process.pid(), path,
+                     fmt::join(authenticator, ""));
 }
 
 bool FileExtensions::verify(const std::string& token, const AuditToken& process) const {

@@ -1,8 +1,10 @@
-// Whole reads and writes on a descriptor that the caller has opened and looked at. Any thread.
+// Whole reads and writes on a descriptor that the caller has opened and looked at, and the bytes of
+// a file as text. Any thread.
 #pragma once
 
 #include <cstddef>
 #include <cstdint>
+#include <span>
 #include <string_view>
 #include <vector>
 
@@ -16,6 +18,9 @@ Result<void> writeAll(int descriptor, std::string_view bytes);
 
 inline std::string_view asText(const std::vector<uint8_t>& bytes) {
   return {reinterpret_cast<const char*>(bytes.data()), bytes.size()};
+}
+inline std::span<const uint8_t> asBytes(std::string_view text) {
+  return {reinterpret_cast<const uint8_t*>(text.data()), text.size()};
 }
 
 }  // namespace platform

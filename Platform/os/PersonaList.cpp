@@ -7,6 +7,7 @@
 #include <optional>
 #include <set>
 
+#include "Platform/os/ConfigurationFile.h"
 #include "Platform/os/RuntimeDirectory.h"
 
 namespace platform {
@@ -55,14 +56,7 @@ Failure readKind(const Value& entry, PersonaAttributes& persona) {
 }
 
 bool isCleanAbsolutePath(std::string_view path) {
-  if (!path.starts_with('/') || path.find('\0') != std::string_view::npos) return false;
-  while (!path.empty()) {
-    path.remove_prefix(1);
-    const std::string_view component = path.substr(0, path.find('/'));
-    if (component.empty() || component == "." || component == "..") return false;
-    path.remove_prefix(component.size());
-  }
-  return true;
+  return path.starts_with('/') && isPathOfNames(path.substr(1));
 }
 
 Failure readLayoutPath(const Value& entry, const std::string& root, PersonaAttributes& persona) {

@@ -45,6 +45,26 @@ void require(bool condition, const char* what) {
   std::abort();
 }
 
+// What one read of inotify's descriptor tells.
+struct FileChanges {
+  std::set<std::pair<int, std::string>> names;  // with inotify's number of their directory
+  bool overflow = false;                        // there were more
+};
+
+FileChanges readFileChanges(int inotify) {
+  FileChanges changes;
+  alignas(inotify_event) std::array<char, 16 * 1024> buffer;
+  const ssize_t length = ::read(inotify, buffer.data(), buffer.size());
+  for (ssize_t offset = 0; offset < length;) {
+    const auto* const event = reinterpret_cast<const inotify_event*>(buffer.data() + offset);
+    if ((event->mask & IN_Q_OVERFLOW) != 0) changes.overflow = true;
+    // The kernel pads the name with zeros.
+    if (event->len > 0) changes.names.emplace(event->wd, std::string(event->name));
+    offset += static_cast<ssize_t>(sizeof(inotify_event) + event->len);
+  }
+  return changes;
+}
+
 // Takes the 8-byte count out of an eventfd or a timerfd.
 void drain(int descriptor) {
   uint64_t count = 0;
@@ -125,22 +145,12 @@ void RunLoop::State::runMainQueue() {
 
 // One call of a handler for all changes that were read together.
 void RunLoop::State::deliverFileChanges() {
-  std::set<std::pair<int, std::string>> changed;
-  bool overflow = false;
-  alignas(inotify_event) std::array<char, 16 * 1024> buffer;
-  const ssize_t length = ::read(inotify.get(), buffer.data(), buffer.size());
-  for (ssize_t offset = 0; offset < length;) {
-    const auto* const event = reinterpret_cast<const inotify_event*>(buffer.data() + offset);
-    if ((event->mask & IN_Q_OVERFLOW) != 0) overflow = true;
-    // The kernel pads the name with zeros.
-    if (event->len > 0) changed.emplace(event->wd, std::string(event->name));
-    offset += static_cast<ssize_t>(sizeof(inotify_event) + event->len);
-  }
+  const FileChanges changes = readFileChanges(inotify.get());
   std::vector<std::shared_ptr<const Handler>> handlers;
   {
     const MutexLock lock(mutex);
     for (const FileWatch& watch : fileWatches) {
-      if (overflow || changed.contains({watch.directory, watch.name})) {
+      if (changes.overflow || changes.names.contains({watch.directory, watch.name})) {
         handlers.push_back(watch.handler);
       }
     }

@@ -71,9 +71,7 @@ std::string hashInHexadecimal(std::string_view identifier) {
   crypto_generichash(hash.data(), hash.size(),
                      reinterpret_cast<const unsigned char*>(identifier.data()), identifier.size(),
                      nullptr, 0);
-  std::string text;
-  for (const unsigned char byte : hash) fmt::format_to(std::back_inserter(text), "{:02x}", byte);
-  return text;
+  return fmt::format("{:02x}", fmt::join(hash, ""));
 }
 
 }  // namespace
@@ -110,9 +108,7 @@ Result<void> prepareRuntimeDirectory(const FileSystem& files) {
   if (!*wasOpen && isOfThisBoot(files, directory, *bootID)) return {};
   if (const auto removed = removeContents(files, directory); !removed) return removed;
   // Last, so that an interrupted emptying is done again.
-  const std::span bytes(reinterpret_cast<const uint8_t*>(bootID->data()), bootID->size());
-  return files.writeFile(directory + "/" + kBootIDName, bytes,
-                         {.mode = 0644, .protectionClass = {}, .atomic = true});
+  return files.writeFile(directory + "/" + kBootIDName, asBytes(*bootID), {.atomic = true});
 }
 
 std::string fileNameForIdentifier(std::string_view identifier) {

@@ -75,11 +75,51 @@ struct Push {
 using Pushes = std::unordered_map<Hash, Push, HashOfHash>;
 
 // What one read of the log found.
-struct LoggedPath {
-  Hash path;
-  size_t line;  // where its last line is
+struct LogContent {
+  struct Path {
+    Hash hash;
+    size_t line;  // where its last line is
+  };
+  std::unordered_map<Hash, Path, HashOfHash> live;
+  size_t lines = 0;
+  size_t malformed = 0;
 };
-using LoggedPaths = std::unordered_map<Hash, LoggedPath, HashOfHash>;
+
+Result<LogContent> readLog(int descriptor, const HashKey& hashKey) {
+  LogContent content;
+  const auto read = forEachLine(descriptor, [&](std::string_view line) {
+    ++content.lines;
+    const auto mapping = parseMappingLine(line);
+    if (!mapping) {
+      ++content.malformed;
+      return;
+    }
+    const Hash key = hashOfMappingKey(
+        hashKey, {mapping->uid, mapping->personaID, mapping->itemType, mapping->identifier});
+    if (mapping->path) {
+      content.live.insert_or_assign(
+          key, LogContent::Path{hashOf(hashKey, *mapping->path), content.lines});
+    } else {
+      content.live.erase(key);
+    }
+  });
+  if (!read) return std::unexpected(read.error());
+  return content;
+}
+
+// The lines that count, from a second read: the first one keeps no text.
+Result<std::string> linesThatCount(int descriptor, const LogContent& content) {
+  std::vector<bool> counts(content.lines + 1);
+  for (const auto& [key, path] : content.live) counts[path.line] = true;
+  if (::lseek(descriptor, 0, SEEK_SET) != 0) return lastErrno();
+  std::string text;
+  size_t number = 0;
+  const auto read = forEachLine(descriptor, [&](std::string_view line) {
+    if (++number < counts.size() && counts[number]) text.append(line) += '\n';
+  });
+  if (!read) return std::unexpected(read.error());
+  return text;
+}
 
 }  // namespace
 
@@ -120,46 +160,18 @@ thread_local Sandbox::Batch::Pending* innermostBatch = nullptr;
 
 // Reads the log into memory and leaves only the lines that count in it.
 Result<void> Sandbox::State::compact(int descriptor) {
-  LoggedPaths live;
-  size_t lines = 0;
-  size_t malformed = 0;
-  const auto read = forEachLine(descriptor, [&](std::string_view line) {
-    ++lines;
-    const auto mapping = parseMappingLine(line);
-    if (!mapping) {
-      ++malformed;
-      return;
-    }
-    const Hash key = hashOfMappingKey(
-        hashKey, {mapping->uid, mapping->personaID, mapping->itemType, mapping->identifier});
-    if (mapping->path) {
-      live.insert_or_assign(key, LoggedPath{hashOf(hashKey, *mapping->path), lines});
-    } else {
-      live.erase(key);
-    }
-  });
-  if (!read) return read;
-  if (malformed > 0) {
+  const auto content = readLog(descriptor, hashKey);
+  if (!content) return std::unexpected(content.error());
+  if (content->malformed > 0) {
     platformLog(LogLevel::error, "Sandbox::compact", "{}: {} malformed lines are dropped",
-                sandboxLogPath(files), malformed);
+                sandboxLogPath(files), content->malformed);
   }
-  std::vector<bool> counts(lines + 1);
   mappings.clear();
-  for (const auto& [key, logged] : live) {
-    mappings.emplace(key, logged.path);
-    counts[logged.line] = true;
-  }
-  if (live.size() == lines) return {};
-  if (::lseek(descriptor, 0, SEEK_SET) != 0) return lastErrno();
-  std::string content;
-  size_t number = 0;
-  const auto readAgain = forEachLine(descriptor, [&](std::string_view line) {
-    if (++number < counts.size() && counts[number]) content.append(line) += '\n';
-  });
-  if (!readAgain) return readAgain;
-  return files.writeFile(sandboxLogPath(files),
-                         {reinterpret_cast<const uint8_t*>(content.data()), content.size()},
-                         {.mode = 0644, .protectionClass = {}, .atomic = true});
+  for (const auto& [key, path] : content->live) mappings.emplace(key, path.hash);
+  if (content->live.size() == content->lines) return {};
+  const auto text = linesThatCount(descriptor, *content);
+  if (!text) return std::unexpected(text.error());
+  return files.writeFile(sandboxLogPath(files), asBytes(*text), {.atomic = true});
 }
 
 Result<void> Sandbox::State::open() {

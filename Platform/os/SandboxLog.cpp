@@ -4,11 +4,10 @@
 #include <unistd.h>
 
 #include <algorithm>
-#include <array>
-#include <charconv>
 #include <functional>
 #include <vector>
 
+#include "Platform/base/WholeNumber.h"
 #include "Platform/os/RuntimeDirectory.h"
 #include "Platform/os/Sandbox.h"
 
@@ -35,12 +34,6 @@ size_t encodedSize(std::string_view text) {
          2 * static_cast<size_t>(std::ranges::count_if(text, std::not_fn(standsForItself)));
 }
 
-template <typename Number>
-bool parseNumber(std::string_view text, Number& number, int base = 10) {
-  const auto parsed = std::from_chars(text.data(), text.data() + text.size(), number, base);
-  return parsed.ec == std::errc() && parsed.ptr == text.data() + text.size();
-}
-
 std::optional<std::string> decoded(std::string_view text) {
   std::string result;
   for (size_t i = 0; i < text.size(); ++i) {
@@ -48,9 +41,10 @@ std::optional<std::string> decoded(std::string_view text) {
       result += text[i];
       continue;
     }
-    uint8_t byte = 0;
-    if (text.size() - i < 3 || !parseNumber(text.substr(i + 1, 2), byte, 16)) return std::nullopt;
-    result += static_cast<char>(byte);
+    if (text.size() - i < 3) return std::nullopt;
+    const auto byte = wholeNumber<uint8_t>(text.substr(i + 1, 2), 16);
+    if (!byte) return std::nullopt;
+    result += static_cast<char>(*byte);
     i += 2;
   }
   return result;
@@ -63,6 +57,11 @@ std::optional<std::string_view> takeField(std::optional<std::string_view>& line)
   const std::string_view field = line->substr(0, tab);
   line = tab == std::string_view::npos ? std::nullopt : std::optional(line->substr(tab + 1));
   return field;
+}
+
+template <typename Number>
+std::optional<Number> takeNumber(std::optional<std::string_view>& line) {
+  return wholeNumber<Number>(takeField(line).value_or(""));
 }
 
 }  // namespace
@@ -96,15 +95,13 @@ std::optional<SandboxMapping> parseMappingLine(std::string_view line) {
   const auto verb = takeField(rest);
   const bool isSet = verb == "set";
   if (!isSet && verb != "clear") return std::nullopt;
-  SandboxMapping mapping;
-  if (!parseNumber(takeField(rest).value_or(""), mapping.uid) ||
-      !parseNumber(takeField(rest).value_or(""), mapping.personaID) ||
-      !parseNumber(takeField(rest).value_or(""), mapping.itemType) || !rest) {
-    return std::nullopt;
-  }
+  const auto uid = takeNumber<uid_t>(rest);
+  const auto personaID = takeNumber<int32_t>(rest);
+  const auto itemType = takeNumber<uint32_t>(rest);
+  if (!uid || !personaID || !itemType || !rest) return std::nullopt;
   auto identifier = decoded(*takeField(rest));
   if (!identifier || rest.has_value() != isSet) return std::nullopt;
-  mapping.identifier = *std::move(identifier);
+  SandboxMapping mapping{*uid, *personaID, *itemType, *std::move(identifier), std::nullopt};
   if (!isSet) return mapping;
   mapping.path = decoded(*takeField(rest));
   if (!mapping.path || rest) return std::nullopt;

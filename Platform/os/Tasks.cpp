@@ -139,7 +139,7 @@ Result<void> Tasks::write(pid_t pid, uint64_t startTime, const TaskRecord& recor
     return made;
   }
   return files_.writeFile(recordPath(files_, pid, startTime), *bytes,
-                          {.mode = kRecordMode, .protectionClass = {}, .atomic = true});
+                          {.mode = kRecordMode, .atomic = true});
 }
 
 Result<std::vector<TaskProcess>> Tasks::processes() const {

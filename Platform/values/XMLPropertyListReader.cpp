@@ -6,9 +6,9 @@
 #include <fmt/format.h>
 
 #include <algorithm>
-#include <charconv>
 #include <pugixml.hpp>
 
+#include "Platform/base/WholeNumber.h"
 #include "Platform/values/PropertyList.h"
 #include "Platform/values/Unicode.h"
 #include "Platform/values/XMLPropertyListScalars.h"
@@ -20,6 +20,10 @@ using namespace xml_property_list;
 using Limits = PropertyListLimits;
 
 constexpr std::string_view kByteOrderMark = "\xEF\xBB\xBF";
+
+// No value is shorter: whoever keeps to the limit of the text keeps to the one of values.
+constexpr std::string_view kShortestValue = "<true/>";
+static_assert(Limits::kXMLBytes / kShortestValue.size() <= Limits::kValues);
 
 // White space between elements is kept so that text which a comment parts stays whole, and text
 // outside the root so that it can be refused.
@@ -70,11 +74,9 @@ std::optional<char32_t> resolveReference(std::string_view name) {
   name.remove_prefix(1);
   const bool hexadecimal = name.starts_with('x');
   if (hexadecimal) name.remove_prefix(1);
-  uint32_t number = 0;
-  const char* end = name.data() + name.size();
-  const auto [stop, error] = std::from_chars(name.data(), end, number, hexadecimal ? 16 : 10);
-  if (error != std::errc() || stop != end || !isXMLCharacter(number)) return std::nullopt;
-  return number;
+  const auto number = wholeNumber<uint32_t>(name, hexadecimal ? 16 : 10);
+  if (!number || !isXMLCharacter(*number)) return std::nullopt;
+  return *number;
 }
 
 // Appends character data with its references resolved; false for one that stands for nothing.
@@ -131,7 +133,6 @@ class Reader {
   }
 
   pugi::xml_document document_;
-  size_t valuesLeft_ = Limits::kValues;
   std::string reason_;
 };
 
@@ -168,7 +169,6 @@ bool Reader::onlyElement(pugi::xml_node parent, pugi::xml_node& element) {
 }
 
 bool Reader::readValue(pugi::xml_node element, size_t depth, Value& into) {
-  if (valuesLeft_-- == 0) return fail("too many values");
   const std::string_view name = element.name();
   if (name != "dict" && name != "array") return readScalar(element, name, into);
   if (depth == Limits::kDepth) return fail(element, "nested too deeply");

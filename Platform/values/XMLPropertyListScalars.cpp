@@ -1,10 +1,10 @@
 #include "Platform/values/XMLPropertyListScalars.h"
 
 #include <array>
-#include <charconv>
 #include <chrono>
-#include <limits>
 #include <utility>
+
+#include "Platform/base/WholeNumber.h"
 
 namespace platform::xml_property_list {
 namespace {
@@ -13,21 +13,6 @@ std::string_view trimmed(std::string_view text) {
   const size_t first = text.find_first_not_of(kSpace);
   if (first == std::string_view::npos) return {};
   return text.substr(first, text.find_last_not_of(kSpace) - first + 1);
-}
-
-// The whole of `text` as a number: std::from_chars takes no sign but the minus of a signed type.
-template <typename Number, typename... Format>
-std::optional<Number> wholeNumber(std::string_view text, Format... format) {
-  Number number{};
-  const char* end = text.data() + text.size();
-  const auto [stop, error] = std::from_chars(text.data(), end, number, format...);
-  if (error != std::errc() || stop != end) return std::nullopt;
-  return number;
-}
-
-// Exactly the digits of `text`, of which there are few.
-std::optional<unsigned> digits(std::string_view text) {
-  return wholeNumber<unsigned>(text);
 }
 
 constexpr uint8_t kNoDigit = 0xFF;
@@ -80,12 +65,12 @@ std::optional<Date> parseDate(std::string_view text) {
       text[16] != ':' || text[19] != 'Z') {
     return std::nullopt;
   }
-  const auto yearNumber = digits(text.substr(0, 4));
-  const auto monthNumber = digits(text.substr(5, 2));
-  const auto dayNumber = digits(text.substr(8, 2));
-  const auto hour = digits(text.substr(11, 2));
-  const auto minute = digits(text.substr(14, 2));
-  const auto second = digits(text.substr(17, 2));
+  const auto yearNumber = wholeNumber<unsigned>(text.substr(0, 4));
+  const auto monthNumber = wholeNumber<unsigned>(text.substr(5, 2));
+  const auto dayNumber = wholeNumber<unsigned>(text.substr(8, 2));
+  const auto hour = wholeNumber<unsigned>(text.substr(11, 2));
+  const auto minute = wholeNumber<unsigned>(text.substr(14, 2));
+  const auto second = wholeNumber<unsigned>(text.substr(17, 2));
   if (!yearNumber || !monthNumber || !dayNumber || !hour || !minute || !second) {
     return std::nullopt;
   }

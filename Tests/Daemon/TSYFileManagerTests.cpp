@@ -214,7 +214,7 @@ TEST_F(TSYFileManagerTest, acceptsOnlyPathsInsideTheBase) {
       {"/x", "", "because real component counts don't make sense", "/"},
   };
   for (const auto& each : cases) {
-    std::ofstream(device_.path("/daemon.log"), std::ios::trunc);
+    write("/daemon.log", "");
     const auto real = manager_.realPathForURL(url(each.suspicious), url(each.base));
     EXPECT_EQ(real ? real->path() : "", each.resolved.empty() ? "" : device_.path(each.resolved))
         << each.suspicious;

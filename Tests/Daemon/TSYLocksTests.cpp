@@ -96,10 +96,10 @@ TEST(TSYLocks, manyThreadsAtOnceKeepTheRules) {
       const TSYIdentifiers identifiers = {std::to_string(i), "0"};
       const unsigned choice = random() % 8;
       if (choice == 0) {
-        const TSYAllIdentifiersLock lock(TSYAllIdentifiersLock::Mode::writing, true);
+        const TSYAllIdentifiersLock lock(TSYLockMode::writing, /*useLocking=*/true);
         change({0, 1, 2});
       } else if (choice == 1) {
-        const TSYAllIdentifiersLock lock(TSYAllIdentifiersLock::Mode::reading, true);
+        const TSYAllIdentifiersLock lock(TSYLockMode::reading, /*useLocking=*/true);
         for (const size_t each : {0U, 1U, 2U}) look(each);
       } else if (choice < 5) {
         TSYLockIdentifiersForWriting(identifiers);

@@ -2,6 +2,7 @@
 
 #include <gtest/gtest.h>
 #include <signal.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <filesystem>
@@ -66,7 +67,7 @@ Device::Device(const std::string& parent, const std::string& user) {
       (parent.empty() ? std::filesystem::temp_directory_path().string() : parent) +
       "/tessary-device-XXXXXX";
   if (::mkdtemp(pattern.data()) == nullptr) throw std::runtime_error("mkdtemp " + pattern);
-  std::filesystem::permissions(pattern, std::filesystem::perms(0755));
+  if (::chmod(pattern.c_str(), 0755) != 0) throw std::runtime_error("chmod " + pattern);
   root_ = std::filesystem::canonical(pattern).string();
   std::vector<std::string> command = {program("tessary-platform"), "--root", root_, "init"};
   if (!user.empty()) command.insert(command.end(), {"--user", user});

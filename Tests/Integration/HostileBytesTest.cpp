@@ -226,7 +226,7 @@ TEST_F(HostileBytes, InIdentifiersAreNoPaths) {
       "%s%n",
       "x\nFORGED line",
       "\x1b[2J\x07\x7f",
-      "x\u2028y\u202e",
+      "x\u2028y\u202ez\u202c",
       std::string(65'536, 'x'),
       repeated("../", 30'000),
       ".com.veltra.tessary.metadata.plist",

@@ -50,7 +50,7 @@ std::string state(uid_t owner, const char* mode, int protectionClass = 0) {
 std::string aclsOf(const std::string& path) {
   std::string result;
   for (const acl_type_t type : std::vector<acl_type_t>{ACL_TYPE_ACCESS, ACL_TYPE_DEFAULT}) {
-    const acl_t acl = ::acl_get_file(path.c_str(), type);
+    acl_t acl = ::acl_get_file(path.c_str(), type);
     if (acl == nullptr) return "none";
     char* const text = ::acl_to_any_text(acl, nullptr, ',', TEXT_ABBREVIATE | TEXT_NUMERIC_IDS);
     result += (result.empty() ? "" : "; ") + std::string(text);

@@ -215,8 +215,7 @@ TEST_F(Rights, StrangeRequestsAreAnswered) {
                     {"CreateIfNecessary", true}});
   };
   const std::string name = "com.example.new";
-  for (const Value& wrong :
-       {Value(0), Value(14), Value(kHuge), Value(-1), Value("2"), Value(true), Value()}) {
+  for (const Value& wrong : Array{0, 14, kHuge, -1, "2", true, Value()}) {
     EXPECT_EQ(codeOf(client, 0, create(name, wrong)), kUnexpectedClass) << wrong.description();
   }
   for (const Value& wrong : {Value(5), Value(), Value(Array{name}), Value(Value::Data{'a'})}) {

@@ -4,12 +4,13 @@
 #include <unistd.h>
 
 #include <algorithm>
-#include <charconv>
 #include <optional>
 #include <string_view>
 #include <vector>
 
+#include "Platform/base/WholeNumber.h"
 #include "Platform/os/Accounts.h"
+#include "Platform/os/OpenFile.h"
 #include "Platform/os/RuntimeDirectory.h"
 #include "Tools/tessary-platform/Command.h"
 
@@ -17,7 +18,6 @@ namespace {
 
 using platform::FileSystem;
 
-constexpr uid_t kMobileUID = 501;
 constexpr gid_t kSystemUsersGID = 250;
 constexpr char kOSRelease[] =
     "NAME=\"Tessary\"\nID=tessary\nVERSION_ID=1.0\nBUILD_ID=1A1\nVARIANT_ID=release\n";
@@ -40,13 +40,9 @@ std::optional<User> userFromArgument(const std::string& argument) {
   if (name.empty() || name[0] == '-' || !std::ranges::all_of(name, isNameCharacter)) {
     return std::nullopt;
   }
-  uid_t uid = 0;
-  const char* const end = argument.data() + argument.size();
-  const auto parsed = std::from_chars(argument.data() + colon + 1, end, uid);
-  if (parsed.ec != std::errc() || parsed.ptr != end || uid >= platform::kNobodyAccount) {
-    return std::nullopt;
-  }
-  return User{name, uid, uid, "/private/var/users/" + name};
+  const auto uid = platform::wholeNumber<uid_t>(std::string_view(argument).substr(colon + 1));
+  if (!uid || *uid >= platform::kNobodyAccount) return std::nullopt;
+  return User{name, *uid, *uid, "/private/var/users/" + name};
 }
 
 // Without root's rights nothing can be given to another user, so mobile is the caller.
@@ -90,8 +86,7 @@ class AccountFile {
     if (!changed_) return {};
     const auto status = files_.status(path_);
     const mode_t mode = status ? status->st_mode & 07777U : 0644;
-    return files_.writeFile(path_, {reinterpret_cast<const uint8_t*>(text_.data()), text_.size()},
-                            {.mode = mode, .protectionClass = {}, .atomic = true});
+    return files_.writeFile(path_, platform::asBytes(text_), {.mode = mode, .atomic = true});
   }
 
  private:
@@ -133,11 +128,9 @@ platform::Result<void> makeTemporaryDirectory(const FileSystem& files) {
 
 platform::Result<void> writeOSRelease(const FileSystem& files) {
   const std::string path = files.root() + "/etc/os-release";
-  const std::string_view text = kOSRelease;
   const auto isThere = [&](const std::string& name) { return files.status(name).has_value(); };
   if (isThere(path) || isThere(files.root() + "/usr/lib/os-release")) return {};
-  return files.writeFile(path, {reinterpret_cast<const uint8_t*>(text.data()), text.size()},
-                         {.mode = 0644, .protectionClass = {}, .atomic = true});
+  return files.writeFile(path, platform::asBytes(kOSRelease), {.atomic = true});
 }
 
 int complainOf(const std::string& what, platform::Errno error) {

@@ -1,14 +1,10 @@
 // persona list, add, remove, replace-file: the user-management service's list. Every change is
 // checked as the daemon would check it and renamed into place, so no reader sees half a list.
-#include <fcntl.h>
-#include <unistd.h>
-
 #include <algorithm>
 #include <vector>
 
 #include "Platform/os/Accounts.h"
 #include "Platform/os/ConfigurationFile.h"
-#include "Platform/os/OpenFile.h"
 #include "Platform/os/PersonaList.h"
 #include "Platform/os/RuntimeDirectory.h"
 #include "Platform/values/PropertyList.h"
@@ -48,8 +44,7 @@ int writeList(const FileSystem& files, const Value& list) {
   if (!bytes) return complainOfList(bytes.error().reason);
   auto written = files.makePath(platform::configurationDirectory(files), 0755);
   if (written) {
-    written = files.writeFile(platform::personaListPath(files), *bytes,
-                              {.mode = 0644, .protectionClass = {}, .atomic = true});
+    written = files.writeFile(platform::personaListPath(files), *bytes, {.atomic = true});
   }
   return written ? kDone : complainOfList(written.error().message());
 }
@@ -81,7 +76,6 @@ Value personaFromOptions(const NewPersona& options) {
 
 // The user whose personas these are has a personal one always; its id is the user's own.
 Value personalPersona(const FileSystem& files) {
-  constexpr uid_t kMobileUID = 501;
   const auto mobile = platform::Accounts(files).accountNamed("mobile");
   return Value::Dictionary{
       {platform::persona_key::kUniqueString, platform::UUID::random().string()},
@@ -118,15 +112,8 @@ int remove(const FileSystem& files, const std::string& uniqueString) {
 }
 
 int replaceFile(const FileSystem& files, const std::string& path) {
-  const platform::FileDescriptor file(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
-  const auto reject = [&](const std::string& reason) {
-    return complain(kBadUsage, fmt::format("{}: {}", path, reason));
-  };
-  if (!file.valid()) return reject(platform::Errno{errno}.message());
-  const auto bytes = platform::readToEnd(file.get(), platform::PropertyListLimits::kBytes);
-  if (!bytes) return reject(bytes.error().message());
-  const auto list = platform::readPropertyList(*bytes);
-  if (!list) return reject(list.error().reason);
+  const auto list = readPropertyListFile(path);
+  if (!list) return complain(kBadUsage, fmt::format("{}: {}", path, list.error()));
   return writeList(files, *list);
 }
 

@@ -1,7 +1,6 @@
 // run: starts a program as an application. Its record is written under the process's own pid and
 // start time before anything is given up or executed: exec keeps both, so the program has its
 // identity from its first instruction on.
-#include <fcntl.h>
 #include <grp.h>
 #include <unistd.h>
 
@@ -9,9 +8,7 @@
 #include <vector>
 
 #include "Platform/os/Accounts.h"
-#include "Platform/os/OpenFile.h"
 #include "Platform/os/Tasks.h"
-#include "Platform/values/PropertyList.h"
 #include "Tools/tessary-platform/Command.h"
 
 namespace {
@@ -36,12 +33,8 @@ std::shared_ptr<const platform::Value::Dictionary> readEntitlements(const std::s
     complain(kBadUsage, fmt::format("--entitlements {}: {}", path, reason));
     return nullptr;
   };
-  const platform::FileDescriptor file(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
-  if (!file.valid()) return reject(platform::Errno{errno}.message());
-  const auto bytes = platform::readToEnd(file.get(), platform::PropertyListLimits::kBytes);
-  if (!bytes) return reject(bytes.error().message());
-  auto value = platform::readPropertyList(*bytes);
-  if (!value) return reject(value.error().reason);
+  auto value = readPropertyListFile(path);
+  if (!value) return reject(value.error());
   if (value->asDictionary() == nullptr) {
     return reject(fmt::format("no dictionary: {}", value->typeName()));
   }

@@ -1,9 +1,6 @@
 // show: everything that the stand-ins keep, read as it stands. Nothing is changed by looking.
-#include <fcntl.h>
-
 #include "Platform/os/Accounts.h"
 #include "Platform/os/ConfigurationFile.h"
-#include "Platform/os/ContainerLayout.h"
 #include "Platform/os/KeyBag.h"
 #include "Platform/os/OpenFile.h"
 #include "Platform/os/PersonaList.h"
@@ -20,6 +17,11 @@ using platform::Value;
 
 void heading(const char* text) {
   fmt::print("\n{}\n", text);
+}
+
+// What is shown in place of something that could not be read.
+std::string absence(platform::Errno error) {
+  return error.value == ENOENT ? "none" : error.message();
 }
 
 // What run/tessary holds is of no meaning once the device has been started anew.
@@ -57,18 +59,14 @@ void showConfiguration(const FileSystem& files, const char* name) {
   heading(fmt::format("etc/tessary/{}", name).c_str());
   const auto value = platform::readConfigurationFile(
       files, fmt::format("{}/{}", platform::configurationDirectory(files), name));
-  if (value) {
-    fmt::print("  {}\n", value->description());
-  } else {
-    fmt::print("  {}\n", value.error().value == ENOENT ? "none" : value.error().message());
-  }
+  fmt::print("  {}\n", value ? value->description() : absence(value.error()));
 }
 
 void showPersonas(const FileSystem& files) {
   heading("personas (etc/tessary/personas.plist)");
   const auto value = platform::readConfigurationFile(files, platform::personaListPath(files));
   if (!value) {
-    fmt::print("  {}\n", value.error().value == ENOENT ? "none" : value.error().message());
+    fmt::print("  {}\n", absence(value.error()));
     return;
   }
   const auto personas = platform::parsePersonaList(*value, files.root());
@@ -123,7 +121,7 @@ void showMappings(const FileSystem& files) {
   heading("sandbox mappings, every push (the last of a key counts)");
   const auto log = files.openItem(platform::sandboxLogPath(files));
   if (!log) {
-    fmt::print("  {}\n", log.error().value == ENOENT ? "none" : log.error().message());
+    fmt::print("  {}\n", absence(log.error()));
     return;
   }
   const auto read = platform::forEachLine(log->get(), [](std::string_view line) {

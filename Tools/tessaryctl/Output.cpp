@@ -5,6 +5,8 @@
 #include <algorithm>
 #include <nlohmann/json.hpp>
 
+#include "Tools/tessaryctl/ValueJSON.h"
+
 using nlohmann::ordered_json;
 
 namespace {
@@ -55,6 +57,23 @@ void Output::print(const std::vector<tessary::ListedContainer>& containers) cons
     fmt::print("{:<{}}  {:<36}  {}\n", container.identifier, width, container.uuid.string(),
                container.personaUniqueString.empty() ? "-" : container.personaUniqueString);
   }
+}
+
+void Output::print(const tessary::Metadata& metadata) const {
+  const std::string info = metadata.info ? jsonOfValue(*metadata.info) : std::string();
+  if (json) {
+    ordered_json value = {{"path", metadata.path}, {"transient", metadata.transient}};
+    if (metadata.info) value["info"] = ordered_json::parse(info);
+    if (metadata.personaUniqueString) value["persona"] = *metadata.personaUniqueString;
+    if (metadata.sandboxToken) value["sandboxToken"] = *metadata.sandboxToken;
+    printJSON(value);
+    return;
+  }
+  fmt::print("path        {}\n", metadata.path);
+  fmt::print("transient   {}\n", metadata.transient ? "yes" : "no");
+  if (metadata.info) fmt::print("info        {}\n", info);
+  if (metadata.personaUniqueString) fmt::print("persona     {}\n", *metadata.personaUniqueString);
+  if (metadata.sandboxToken) fmt::print("token       {}\n", *metadata.sandboxToken);
 }
 
 void Output::print(const std::string& key, const std::string& text) const {

@@ -76,7 +76,7 @@ class Scratch {
 
 // The short text of an ACL, as getfacl prints it.
 inline std::string aclText(const std::string& path, acl_type_t type) {
-  const acl_t acl = ::acl_get_file(path.c_str(), type);
+  acl_t acl = ::acl_get_file(path.c_str(), type);
   if (acl == nullptr) return "none";
   char* const text = ::acl_to_text(acl, nullptr);
   std::string result = text;

@@ -7,7 +7,9 @@
 #include <sys/xattr.h>
 
 #include <algorithm>
+#include <cerrno>
 #include <map>
+#include <system_error>
 #include <thread>
 
 #include "Platform/fs/AccessControl.h"
@@ -19,14 +21,20 @@ namespace {
 
 constexpr int kDeep = 10000;
 
+FileDescriptor directoryAt(int parent, const std::string& path) {
+  FileDescriptor directory(::openat(parent, path.c_str(), O_RDONLY | O_DIRECTORY));
+  if (!directory.valid()) throw std::system_error(errno, std::generic_category(), path);
+  return directory;
+}
+
 // A chain of directories, each with a file beside the next one: deeper than any path can be.
 void buildDeepTree(const std::string& path) {
   std::filesystem::create_directory(path);
-  FileDescriptor directory(::open(path.c_str(), O_RDONLY | O_DIRECTORY));
+  FileDescriptor directory = directoryAt(AT_FDCWD, path);
   for (int depth = 0; depth < kDeep; ++depth) {
     ASSERT_EQ(::mkdirat(directory.get(), "d", 0700), 0);
     ASSERT_EQ(::mknodat(directory.get(), "f", S_IFREG | 0600, 0), 0);
-    directory = FileDescriptor(::openat(directory.get(), "d", O_RDONLY | O_DIRECTORY));
+    directory = directoryAt(directory.get(), "d");
   }
 }
 

@@ -6,23 +6,31 @@
 #include <sys/socket.h>
 #include <sys/un.h>
 
+#include <cerrno>
 #include <cstdlib>
 #include <regex>
+#include <system_error>
 
 #include "Platform/os/SystemLog.h"
 
 namespace platform {
 namespace {
 
+int unixSocket() {
+  const int socket = ::socket(AF_UNIX, SOCK_STREAM, 0);
+  if (socket < 0) throw std::system_error(errno, std::generic_category(), "socket");
+  return socket;
+}
+
 TEST(ServiceManager, HandsOverListeningSocketsByName) {
   const ServiceManager service;
   EXPECT_FALSE(service.takeSocket("first").valid());
   // The manager's sockets come as descriptors 3 and up.
-  const int listening = ::socket(AF_UNIX, SOCK_STREAM, 0);
+  const int listening = unixSocket();
   const sockaddr_un unnamed{.sun_family = AF_UNIX, .sun_path = {}};
   ASSERT_EQ(::bind(listening, reinterpret_cast<const sockaddr*>(&unnamed), sizeof(sa_family_t)), 0);
   ASSERT_EQ(::listen(listening, 1), 0);
-  const int plain = ::socket(AF_UNIX, SOCK_STREAM, 0);
+  const int plain = unixSocket();
   const int sources[] = {::fcntl(plain, F_DUPFD, 10), ::fcntl(listening, F_DUPFD, 10)};
   for (int i = 0; i < 2; ++i) ASSERT_EQ(::dup2(sources[i], 3 + i), 3 + i);
   ::setenv("LISTEN_PID", std::to_string(::getpid()).c_str(), 1);

@@ -5,6 +5,7 @@
 #include <cmath>
 #include <cstdio>
 #include <fstream>
+#include <stdexcept>
 
 #include "Platform/values/PropertyList.h"
 
@@ -22,6 +23,7 @@ std::string rewritten(const Value::Data& bytes, const std::string& format) {
       "stdout.buffer.write(plistlib.dumps(value, fmt=plistlib." +
       format + "))' '" + path + "'";
   FILE* pipe = ::popen(command.c_str(), "r");
+  if (pipe == nullptr) throw std::runtime_error("popen");
   std::string output;
   std::array<char, 65536> buffer{};
   while (const size_t size = std::fread(buffer.data(), 1, buffer.size(), pipe)) {
