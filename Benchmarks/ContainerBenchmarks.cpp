@@ -4,16 +4,14 @@
 #include <dirent.h>
 #include <fcntl.h>
 #include <fmt/format.h>
-#include <sys/stat.h>
-#include <sys/xattr.h>
 #include <unistd.h>
 
 #include <array>
 #include <memory>
 
+#include "Benchmarks/BareWork.h"
 #include "Benchmarks/Samples.h"
 #include "Benchmarks/Scratch.h"
-#include "Platform/values/PropertyList.h"
 #include "Platform/values/UUID.h"
 
 namespace {
@@ -22,42 +20,7 @@ using platform::FileDescriptor;
 using platform::UUID;
 using platform::Value;
 
-constexpr uid_t kUser = 501;
-constexpr char kMetadataFile[] = ".com.veltra.tessary.metadata.plist";
-
-void check(bool succeeded, const char* failure) {
-  if (!succeeded) die(failure);
-}
-
-Value::Data metadata(const std::string& identifier) {
-  const Value::Dictionary content{
-      {"TSYMetadataVersion", "2"},
-      {"TSYMetadataIdentifier", identifier},
-      {"TSYMetadataUUID", UUID::random().string()},
-      {"TSYMetadataContentClass", uint64_t{2}},
-      {"TSYMetadataUserIdentity", Value::Dictionary{{"version", "2"},
-                                                    {"posixUID", uint64_t{kUser}},
-                                                    {"posixGID", uint64_t{kUser}},
-                                                    {"type", uint64_t{0}}}}};
-  return *platform::writeBinaryPropertyList(content);
-}
-
-void writeSynced(const std::string& path, const Value::Data& bytes) {
-  const FileDescriptor file(::open(path.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0644));
-  check(file.valid(), "cannot open");
-  check(::fsetxattr(file.get(), "trusted.tessary.protection-class", "4", 1, 0) == 0,
-        "cannot fsetxattr");
-  check(::write(file.get(), bytes.data(), bytes.size()) == static_cast<ssize_t>(bytes.size()),
-        "cannot write");
-  check(::fsync(file.get()) == 0, "cannot fsync");
-}
-
-void makeOwnedDirectory(const std::string& path) {
-  check(::mkdir(path.c_str(), 0755) == 0, "cannot mkdir");
-  check(::chown(path.c_str(), kUser, kUser) == 0, "cannot chown");
-}
-
-// What a creation comes to, and nothing else: no look at what is there, no care for links.
+// What a creation comes to, and nothing else.
 void createBare(const std::string& staging, const std::string& live, const Value::Data& bytes) {
   constexpr std::array kSubdirectories = {"Documents",           "Library",    "Library/Caches",
                                           "Library/Preferences", "SystemData", "tmp"};
@@ -66,12 +29,11 @@ void createBare(const std::string& staging, const std::string& live, const Value
   const std::string temporary = staging + "/temp_metadata-" + name + ".plist";
   makeOwnedDirectory(container);
   writeSynced(temporary, bytes);
-  check(::rename(temporary.c_str(), (container + "/" + kMetadataFile).c_str()) == 0,
-        "cannot rename");
+  rename(temporary, container + "/" + kMetadataFile);
   for (const char* subdirectory : kSubdirectories) {
     makeOwnedDirectory(container + "/" + subdirectory);
   }
-  check(::rename(container.c_str(), (live + "/" + name).c_str()) == 0, "cannot rename");
+  rename(container, live + "/" + name);
 }
 
 void creation(benchmark::State& state) {

@@ -190,8 +190,7 @@ Result<void> Client::stageForDelete(const std::vector<ContainerName>& containers
     classes.emplace_back(container.containerClass);
     uuids.emplace_back(container.uuid);
     identifiers.emplace_back(container.identifier);
-    personas.emplace_back(container.personaUniqueString ? Value(*container.personaUniqueString)
-                                                        : Value());
+    personas.emplace_back(container.personaUniqueString.value_or(""));
   }
   Message request;
   request.set("ContainerClassesArray", std::move(classes));

@@ -1,5 +1,4 @@
 // The short names of the daemon's codes, and what they mean.
-
 #include <algorithm>
 #include <array>
 #include <string_view>

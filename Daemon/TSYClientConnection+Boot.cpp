@@ -1,5 +1,4 @@
 // What start-up runs on the daemon's own connection.
-
 #include "Daemon/TSYClientConnection.h"
 #include "Daemon/TSYContainerCache.h"
 #include "Daemon/TSYDaemonQueues.h"

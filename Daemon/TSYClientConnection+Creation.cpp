@@ -4,8 +4,7 @@
 // appears at its live path with one rename, the point of commitment. So what is visible there is
 // always complete. What a failure leaves in staging goes to death row at once; what a crash leaves
 // there is cleaned up at the next start.
-
-#include <cstdlib>
+#include <algorithm>
 
 #include "Daemon/TSYClientConnection.h"
 #include "Daemon/TSYContainerCache.h"
@@ -80,7 +79,7 @@ uid_t ownerOfContent(const TSYMetadata& metadata) {
 
 bool isExcludedFromUserData(const std::string& name) {
   const auto& excluded = TSYGlobalConfiguration::sharedInstance().excludedFromAppUserData();
-  return std::find(excluded.begin(), excluded.end(), name) != excluded.end();
+  return std::ranges::find(excluded, name) != excluded.end();
 }
 
 }  // namespace
@@ -107,8 +106,9 @@ TSYResult<TSYMetadataRef> TSYClientConnection::createOrLookup(
                 *identity, createIfNecessary, transient, allowOtherIdLookup_, unrestricted_,
                 clientBundleIdentifier());
   }
-  if (auto allowed = checkAccess(*identity); !allowed)
+  if (auto allowed = checkAccess(*identity); !allowed) {
     return TSYFailure(std::move(allowed.error()));
+  }
 
   TSYContainerCache& cache = TSYContainerCache::sharedInstance();
   if (!transient) {
@@ -216,7 +216,7 @@ TSYResult<TSYURL> TSYClientConnection::moveIntoPlace(const TSYContainerIdentity&
                                      "Failed to move staging dir: {} to live dir: {}",
                                      stagingURL.path(), "(null)"));
   }
-  const TSYURL liveURL = directory->appending(name);
+  TSYURL liveURL = directory->appending(name);
   const auto moved = TSYFileManager::defaultManager().moveItemAtURL(stagingURL, liveURL);
   if (!moved) {
     return TSYFailure(TSYErrorCreate(TSYErrorStagingMoveFailed, moved.error(), TSYLogIt::yes,

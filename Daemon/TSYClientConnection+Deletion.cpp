@@ -1,6 +1,5 @@
 // Death row: what is to be deleted is renamed out of sight first and removed later, by one task at
 // a time on a queue of its own. Nothing on death row is ever read back.
-
 #include <algorithm>
 
 #include "Daemon/TSYClientConnection.h"

@@ -2,7 +2,7 @@
 // and its size; and the groups of an owner.
 //
 // What is found before its lock is taken is found again under the lock before it is changed.
-
+#include "Daemon/TSYCacheSteps.h"
 #include "Daemon/TSYClientConnection.h"
 #include "Daemon/TSYContainerCache.h"
 #include "Daemon/TSYException.h"
@@ -22,24 +22,6 @@ namespace {
 constexpr char kStaticDiskUsageKey[] = "com.veltra.Hatchery.StaticDiskUsage";
 // Other services hold its path for good.
 constexpr char kAnalyticsGroup[] = "systemgroup.com.veltra.analytics";
-
-TSYMetadataRef find(const TSYConcreteContainerIdentity& identity) {
-  return TSYContainerCache::sharedInstance().containerForContainerIdentity(identity);
-}
-
-TSYError notFound(const TSYConcreteContainerIdentity& identity) {
-  return TSYErrorCreate(TSYErrorNotFound, std::nullopt, TSYLogIt::yes,
-                        "No Container with identity: {}", identity.description());
-}
-
-TSYResult<void> addToCache(const TSYMetadata& container, const TSYURL& url, bool updateSandbox) {
-  const auto added = TSYContainerCache::sharedInstance().addContainerMetadata(
-      container, url, container.transient(), updateSandbox);
-  if (added) return {};
-  return TSYFailure(TSYErrorCreate(TSYErrorCacheAddFailed, added.error(), TSYLogIt::yes,
-                                   "Failed to add to cache: {}, url: {}, transient: {:d}",
-                                   container.description(), url.path(), container.transient()));
-}
 
 TSYMetadata::Info withValue(const TSYMetadata::Info& info, const std::string& key,
                             const std::optional<Value>& value) {
@@ -75,12 +57,12 @@ TSYResult<void> TSYClientConnection::setInfoValue(const std::optional<Value>& va
                                      "(null)"));
   }
   const TSYIdentifierLock lock(TSYLockMode::writing, identity.uuid().string(), useLocking);
-  const TSYMetadataRef container = find(identity);
-  if (!container) return TSYFailure(notFound(identity));
-  TSYMetadata changed = *container;
-  changed.setInfo(withValue(container->info(), *key, value));
+  const auto container = TSYFindContainer(identity);
+  if (!container) return TSYFailure(container.error());
+  TSYMetadata changed = **container;
+  changed.setInfo(withValue(changed.info(), *key, value));
   if (auto written = changed.writeMetadataToDisk(); !written) return written;
-  return addToCache(changed, changed.url(), /*updateSandbox=*/false);
+  return TSYAddToCache(changed, changed.url(), changed.transient(), /*updateSandbox=*/false);
 }
 
 TSYResult<Value> TSYClientConnection::infoValueForKey(const std::optional<std::string>& key,
@@ -92,11 +74,10 @@ TSYResult<Value> TSYClientConnection::infoValueForKey(const std::optional<std::s
                                      "(null)"));
   }
   const TSYIdentifierLock lock(TSYLockMode::reading, identity.uuid().string(), useLocking);
-  const TSYMetadataRef container = find(identity);
-  if (!container) return TSYFailure(notFound(identity));
-  if (container->info()) {
-    const auto found = container->info()->find(*key);
-    if (found != container->info()->end()) return found->second;
+  const auto container = TSYFindContainer(identity);
+  if (!container) return TSYFailure(container.error());
+  if (const TSYMetadata::Info& info = (*container)->info()) {
+    if (const auto found = info->find(*key); found != info->end()) return found->second;
   }
   return TSYFailure(TSYErrorCreate(TSYErrorInfoValueNotFound, std::nullopt, TSYLogIt::no,
                                    "Didn't find info value for key: {}", *key));
@@ -106,7 +87,9 @@ TSYResult<TSYMetadataRef> TSYClientConnection::metadataWithContainerIdentity(
     const TSYConcreteContainerIdentity& identity) {
   const TSYIdentifierLock lock(TSYLockMode::reading, identity.uuid().string(),
                                /*useLocking=*/true);
-  if (TSYMetadataRef container = find(identity)) return container;
+  TSYMetadataRef container =
+      TSYContainerCache::sharedInstance().containerForContainerIdentity(identity);
+  if (container) return container;
   return TSYFailure(TSYErrorCreate(TSYErrorNotFound, std::nullopt, TSYLogIt::yes,
                                    "No Container with user identity: {}", identity.description()));
 }
@@ -115,11 +98,12 @@ TSYResult<void> TSYClientConnection::recreateDefaultStructureWithContainerIdenti
     const TSYConcreteContainerIdentity& identity) {
   const TSYIdentifierLock lock(TSYLockMode::writing, identity.uuid().string(),
                                /*useLocking=*/true);
-  const TSYMetadataRef container = find(identity);
-  if (!container) return TSYFailure(notFound(identity));
-  auto created = _createSubDirectories(container->url(), *container);
-  if (!created || !TSYIsSystemClass(container->containerClass())) return created;
-  return TSYFileManager::defaultManager().standardizeACLsForSystemContainerAtURL(container->url());
+  const auto container = TSYFindContainer(identity);
+  if (!container) return TSYFailure(container.error());
+  const TSYURL url = (*container)->url();
+  auto created = _createSubDirectories(url, **container);
+  if (!created || !TSYIsSystemClass((*container)->containerClass())) return created;
+  return TSYFileManager::defaultManager().standardizeACLsForSystemContainerAtURL(url);
 }
 
 TSYResult<void> TSYClientConnection::regenerateDirectoryUUIDWithContainerIdentity(
@@ -129,11 +113,11 @@ TSYResult<void> TSYClientConnection::regenerateDirectoryUUIDWithContainerIdentit
 
 TSYResult<void> TSYClientConnection::regenerateDirectoryUUID(
     const TSYConcreteContainerIdentity& identity) {
-  if (!find(identity)) return TSYFailure(notFound(identity));
+  if (auto found = TSYFindContainer(identity); !found) return TSYFailure(std::move(found.error()));
   const TSYAllIdentifiersLock lock(TSYLockMode::writing, /*useLocking=*/true);
-  const TSYMetadataRef container = find(identity);
-  if (!container) return TSYFailure(notFound(identity));
-  const TSYURL url = container->url();
+  const auto container = TSYFindContainer(identity);
+  if (!container) return TSYFailure(container.error());
+  const TSYURL url = (*container)->url();
   const std::string name(url.lastPathComponent());
   if (!UUID::parse(name)) {
     return TSYFailure(TSYErrorCreate(TSYErrorInvalidObject, std::nullopt, TSYLogIt::yes,
@@ -147,7 +131,7 @@ TSYResult<void> TSYClientConnection::regenerateDirectoryUUID(
                                      "Failed to move dir: {} to new UUID dir: {}", url.path(),
                                      newURL.path()));
   }
-  return addToCache(*container, newURL, /*updateSandbox=*/true);
+  return TSYAddToCache(**container, newURL, (*container)->transient(), /*updateSandbox=*/true);
 }
 
 void TSYClientConnection::_regenerateAllSystemContainerPaths() {
@@ -184,8 +168,9 @@ TSYResult<uint64_t> TSYClientConnection::diskUsage(const TSYConcreteContainerIde
   {
     const TSYIdentifierLock lock(TSYLockMode::reading, identity.uuid().string(),
                                  /*useLocking=*/true);
-    container = find(identity);
-    if (!container) return TSYFailure(notFound(identity));
+    auto found = TSYFindContainer(identity);
+    if (!found) return TSYFailure(std::move(found.error()));
+    container = std::move(*found);
     if (isMeasuredOnce(container->containerClass())) {
       const auto known = infoValueForKey(kStaticDiskUsageKey, identity, /*useLocking=*/false);
       if (known && known->isNumber()) return known->unsignedOfNumber().value_or(0);
@@ -208,13 +193,7 @@ TSYResult<uint64_t> TSYClientConnection::diskUsage(const TSYConcreteContainerIde
 
 TSYResult<void> TSYClientConnection::checkGroupAccess(const std::string& ownerIdentifier,
                                                       TSYContainerClass groupContainerClass) {
-  const bool isOwn = clientIdentity_ && ownerIdentifier == clientBundleIdentifier();
-  if (isOwn || allowOtherIdLookup_ || unrestricted_ ||
-      isEntitledForLookupWithClass(groupContainerClass, ownerIdentifier) ||
-      TSYWhitelist::sharedWhitelist().isLookupWhitelistedFromCodeSignIdentifier(
-          clientBundleIdentifier(), groupContainerClass, ownerIdentifier)) {
-    return {};
-  }
+  if (mayLookUpOf(groupContainerClass, ownerIdentifier)) return {};
   return TSYFailure(TSYErrorCreate(TSYErrorNotEntitled, std::nullopt, TSYLogIt::yes,
                                    "{} not entitled to retrieve group container class {} with "
                                    "identifier {}",

@@ -5,17 +5,16 @@
 // rename. So at every point one of three holds: the old path is occupied (nothing has moved, or all
 // is done), the destination is occupied (done), or both are empty and the old container is in
 // staging, from where the next start puts it back. What fails in between is undone at once.
-
-#include <cstdlib>
-
+#include "Daemon/TSYCacheSteps.h"
 #include "Daemon/TSYClientConnection.h"
-#include "Daemon/TSYCodeSigningMapping.h"
 #include "Daemon/TSYContainerCache.h"
+#include "Daemon/TSYContainerExchange.h"
 #include "Daemon/TSYException.h"
 #include "Daemon/TSYFileManager.h"
 #include "Daemon/TSYGlobalConfiguration.h"
 #include "Daemon/TSYLocks.h"
 #include "Daemon/TSYLog.h"
+#include "Daemon/TSYMetadataKeys.h"
 #include "Daemon/TSYPropertyList.h"
 #include "Platform/os/Platform.h"
 
@@ -28,175 +27,6 @@ constexpr char kOldURLKey[] = "TSYReplaceOperationOldURL";
 constexpr char kNewURLKey[] = "TSYReplaceOperationNewURL";
 constexpr char kStagingURLKey[] = "TSYReplaceOperationStagingURL";
 constexpr char kDestinationURLKey[] = "TSYReplaceOperationDestURL";
-
-TSYFileManager& fileManager() {
-  return TSYFileManager::defaultManager();
-}
-
-TSYResult<TSYMetadataRef> find(const TSYConcreteContainerIdentity& identity) {
-  TSYMetadataRef container =
-      TSYContainerCache::sharedInstance().containerForContainerIdentity(identity);
-  if (container) return container;
-  return TSYFailure(TSYErrorCreate(TSYErrorNotFound, std::nullopt, TSYLogIt::yes,
-                                   "No Container with identity: {}", identity.description()));
-}
-
-TSYResult<void> dropFromCache(const TSYMetadata& container) {
-  const auto removed = TSYContainerCache::sharedInstance().removeContainerForUserIdentity(
-      container.userIdentity(), container.containerClass(), container.identifier(),
-      container.transient());
-  if (removed) return {};
-  return TSYFailure(TSYErrorCreate(TSYErrorCacheRemoveFailed, removed.error(), TSYLogIt::yes,
-                                   "Failed to remove from cache id: {}, class: {}, transient: {:d}",
-                                   container.identifier(), container.containerClass(),
-                                   container.transient()));
-}
-
-TSYResult<void> enterIntoCache(const TSYMetadata& container, const TSYURL& url, bool transient) {
-  const auto added = TSYContainerCache::sharedInstance().addContainerMetadata(
-      container, url, transient, /*updateSandbox=*/true);
-  if (added) return {};
-  return TSYFailure(TSYErrorCreate(TSYErrorCacheAddFailed, added.error(), TSYLogIt::yes,
-                                   "Failed to add to cache: {}, url: {}, transient: {:d}",
-                                   container.description(), url.path(), transient));
-}
-
-// What has been renamed into a directory stays there after a power cut.
-TSYResult<void> syncDirectoryOf(const TSYURL& item) {
-  const TSYURL directory = item.deletingLastPathComponent();
-  const auto synced = platform::Platform::current().files.syncDirectory(directory.path());
-  if (synced) return {};
-  return TSYFailure(TSYPosixErrorCreate(synced.error(), "fsync of {} failed: {}", directory.path(),
-                                        synced.error().message()));
-}
-
-// The two containers of a replace while they change places. Unless run() succeeds, undo() puts them
-// back; an exception does so too, and ends the process when it cannot: the journal is there then.
-class Exchange {
- public:
-  // `old` is null when the new container only becomes a regular one. With `uuidToKeep` the new one
-  // gets that UUID before it is seen at the destination.
-  Exchange(TSYMetadataRef old, TSYMetadataRef replacement, std::optional<UUID> uuidToKeep,
-           TSYURL staging, TSYURL destination)
-      : old_(std::move(old)),
-        replacement_(std::move(replacement)),
-        uuidToKeep_(uuidToKeep),
-        staging_(std::move(staging)),
-        destination_(std::move(destination)) {}
-  ~Exchange() {
-    if (!over_ && !undo()) std::abort();
-  }
-  Exchange(const Exchange&) = delete;
-  Exchange& operator=(const Exchange&) = delete;
-
-  TSYResult<void> run() {
-    if (old_) {
-      if (auto aside = takeOldAside(); !aside) return aside;
-    }
-    if (auto inPlace = putReplacementInPlace(); !inPlace) return inPlace;
-    over_ = true;
-    return {};
-  }
-
-  // Returns whether the old container is where it was: if not, it is in staging.
-  bool undo() {
-    over_ = true;
-    if (isReplacementMoved_) takeReplacementBack();
-    if (isUUIDWritten_ && !replacement_->writeMetadataToDisk()) {
-      TSYLogWrite(TSYLogLevelError, "Failed to give {} its UUID back", replacement_->url().path());
-    }
-    const bool isOldBack = !isOldStaged_ || putOldBack();
-    if (isOldDropped_ && isOldBack) {
-      (void)enterIntoCache(*old_, old_->url(), old_->transient());
-    }
-    if (isReplacementDropped_ && fileManager().itemExistsAtURL(replacement_->url())) {
-      (void)enterIntoCache(*replacement_, replacement_->url(), replacement_->transient());
-    }
-    return isOldBack;
-  }
-
- private:
-  TSYResult<void> takeOldAside() {
-    const auto moved = fileManager().moveItemAtURL(old_->url(), staging_);
-    if (!moved) {
-      return TSYFailure(TSYErrorCreate(TSYErrorReplaceStageOldFailed, moved.error(), TSYLogIt::yes,
-                                       "Failed to move old {} to staging {}", old_->url().path(),
-                                       staging_.path()));
-    }
-    isOldStaged_ = true;
-    if (auto dropped = dropFromCache(*old_); !dropped) return dropped;
-    isOldDropped_ = true;
-    if (!TSYIsBundleClass(old_->containerClass())) return {};
-    auto invalidated =
-        TSYCodeSigningMapping::sharedInstance()
-            .invalidateCodeSigningInfoForIdentifierAndItsChildren(old_->identifier());
-    if (!invalidated) {
-      TSYLogWrite(TSYLogLevelError, "Failed to invalidate code signing info for {}",
-                  old_->identifier());
-    }
-    return invalidated;
-  }
-
-  TSYResult<void> putReplacementInPlace() {
-    TSYMetadata metadata = *replacement_;
-    if (uuidToKeep_) {
-      metadata.setUUID(*uuidToKeep_);
-      isUUIDWritten_ = true;
-      if (auto written = metadata.writeMetadataToDisk(); !written) return written;
-    }
-    if (auto moved = moveReplacement(); !moved) return moved;
-    if (auto dropped = dropFromCache(*replacement_); !dropped) return dropped;
-    isReplacementDropped_ = true;
-    return enterIntoCache(metadata, destination_, old_ && old_->transient());
-  }
-
-  TSYResult<void> moveReplacement() {
-    auto moved = fileManager().moveItemAtURL(replacement_->url(), destination_);
-    isReplacementMoved_ = moved.has_value();
-    if (moved) moved = syncDirectoryOf(destination_);
-    if (moved) return {};
-    return TSYFailure(TSYErrorCreate(TSYErrorReplaceFailed, moved.error(), TSYLogIt::yes,
-                                     "Failed to replace: {} with: {} at: {}",
-                                     old_ ? old_->url().path() : "(null)",
-                                     replacement_->url().path(), destination_.path()));
-  }
-
-  // The destination must be free for the old container, if need be at the cost of the new one.
-  void takeReplacementBack() {
-    const auto moved = fileManager().moveItemAtURL(destination_, replacement_->url());
-    if (moved) return;
-    TSYLogWrite(TSYLogLevelError, "Failed to move {} back to {}: {}", destination_.path(),
-                replacement_->url().path(), moved.error());
-    isUUIDWritten_ = false;
-    (void)TSYClientConnection::_moveItemAtURLToDeathRow(destination_,
-                                                        /*startDeletionThread=*/false);
-  }
-
-  bool putOldBack() {
-    TSYLogWrite(TSYLogLevelDebug, "Recovering from failed replace by moving: {} to {}",
-                staging_.path(), old_->url().path());
-    const auto moved = fileManager().moveItemAtURL(staging_, old_->url());
-    if (moved) return true;
-    (void)TSYErrorCreate(TSYErrorReplaceFileInvalid, moved.error(), TSYLogIt::yes,
-                         "Failed to recover replace move: {} to {}", staging_.path(),
-                         old_->url().path());
-    return false;
-  }
-
-  const TSYMetadataRef old_;
-  const TSYMetadataRef replacement_;
-  const std::optional<UUID> uuidToKeep_;
-  const TSYURL staging_;
-  const TSYURL destination_;
-
-  // How far it has come.
-  bool isOldStaged_ = false;
-  bool isOldDropped_ = false;
-  bool isUUIDWritten_ = false;
-  bool isReplacementMoved_ = false;
-  bool isReplacementDropped_ = false;
-  bool over_ = false;
-};
 
 TSYResult<void> checkReplace(const TSYConcreteContainerIdentity* old,
                              const TSYConcreteContainerIdentity& replacement,
@@ -244,7 +74,7 @@ TSYResult<TSYURL> freeDestination(const TSYMetadata* old, const TSYMetadata& rep
         old == nullptr ? "(null)" : old->url().path(), replacement.url().path(), "(null)"));
   }
   TSYURL destination = directory->appending(replacement.url().lastPathComponent());
-  if (!fileManager().itemExistsAtURL(destination)) return destination;
+  if (!TSYFileManager::defaultManager().itemExistsAtURL(destination)) return destination;
   return TSYFailure(TSYErrorCreate(TSYErrorAlreadyExists, std::nullopt, TSYLogIt::yes,
                                    "Container already exists at {}", destination.path()));
 }
@@ -266,11 +96,34 @@ TSYResult<void> checkNoRegularContainer(const TSYConcreteContainerIdentity& iden
 
 // Runs it; what fails is undone.
 TSYResult<void> promote(TSYMetadataRef replacement, TSYURL destination) {
-  Exchange exchange(nullptr, std::move(replacement), std::nullopt, TSYURL(),
-                    std::move(destination));
+  TSYContainerExchange exchange(nullptr, std::move(replacement), std::nullopt, TSYURL(),
+                                std::move(destination));
   auto result = exchange.run();
   if (!result) exchange.undo();
   return result;
+}
+
+// The UUID in a container's metadata file; null when it cannot be read.
+const std::string* uuidIn(const TSYResult<Value::Dictionary>& metadata) {
+  if (!metadata) return nullptr;
+  const auto found = metadata->find(kTSYMetadataUUID);
+  return found == metadata->end() ? nullptr : found->second.asString();
+}
+
+// A crash after the new container was given the UUID of the old one, which is back, leaves two of
+// that UUID. The new one's own is forgotten: it gets another.
+void tellApart(const TSYURL& old, const TSYURL& replacement) {
+  const TSYURL file = replacement.appending(kTSYMetadataFileName);
+  if (!TSYFileManager::defaultManager().itemExistsAtURL(file)) return;
+  auto metadata = TSY_dictionaryWithContentsOfURL(file);
+  const auto metadataOfOld = TSY_dictionaryWithContentsOfURL(old.appending(kTSYMetadataFileName));
+  const std::string* uuid = uuidIn(metadata);
+  const std::string* uuidOfOld = uuidIn(metadataOfOld);
+  if (uuid == nullptr || uuidOfOld == nullptr || *uuid != *uuidOfOld) return;
+  metadata->insert_or_assign(kTSYMetadataUUID, UUID::random().string());
+  const auto written = TSY_writeToURL(*metadata, file, kTSYWriteAtomic | kTSYWriteProtectionNone);
+  if (written) return;
+  TSYLogWrite(TSYLogLevelError, "Failed to give {} another UUID: {}", file.path(), written.error());
 }
 
 // After a replace and one that was undone: what is left in staging is garbage.
@@ -307,11 +160,11 @@ TSYResult<void> TSYClientConnection::replace(const TSYContainerIdentity& old,
   const TSYAllIdentifiersLock lock(TSYLockMode::writing, /*useLocking=*/true);
   TSYMetadataRef oldContainer;
   if (concreteOld != nullptr) {
-    auto found = find(*concreteOld);
+    auto found = TSYFindContainer(*concreteOld);
     if (!found) return TSYFailure(std::move(found.error()));
     oldContainer = std::move(*found);
   }
-  const auto newContainer = find(replacement);
+  const auto newContainer = TSYFindContainer(replacement);
   if (!newContainer) return TSYFailure(newContainer.error());
   if (auto valid = checkDirectories(oldContainer.get(), **newContainer); !valid) return valid;
   const auto destination = preserveOldUUID ? TSYResult<TSYURL>(oldContainer->url())
@@ -340,8 +193,9 @@ TSYResult<void> TSYClientConnection::replaceJournalled(const TSYMetadataRef& old
   auto result =
       _writeToDiskReplaceAt(journal, {old->url(), replacement->url(), staging, destination});
   if (result) {
-    Exchange exchange(old, replacement, preserveOldUUID ? std::optional(old->uuid()) : std::nullopt,
-                      staging, destination);
+    TSYContainerExchange exchange(old, replacement,
+                                  preserveOldUUID ? std::optional(old->uuid()) : std::nullopt,
+                                  staging, destination);
     result = exchange.run();
     // The old container is in staging still: the next start puts it back.
     if (!result && !exchange.undo()) return result;
@@ -367,7 +221,7 @@ TSYResult<void> TSYClientConnection::_writeToDiskReplaceAt(const TSYURL& journal
                                  {kStagingURLKey, staging.path()},
                                  {kDestinationURLKey, destination.path()}},
                                 journal, kTSYWriteAtomic | kTSYWriteProtectionNone);
-  if (written) written = syncDirectoryOf(journal);
+  if (written) written = TSYFileManager::defaultManager().syncDirectoryOfItemAtURL(journal);
   if (written) return {};
   return TSYFailure(TSYErrorCreate(TSYErrorWriteFailed, written.error(), TSYLogIt::yes,
                                    "Failed to write replace dictionary to URL {}", journal.path()));
@@ -403,7 +257,8 @@ TSYResult<TSYClientConnection::ReplaceURLs> TSYClientConnection::_readAndValidat
 // One that cannot be repaired does not keep the others from it.
 TSYResult<void> TSYClientConnection::_recoverFromReplaceOperations() {
   const TSYURL directory = TSYGlobalConfiguration::sharedInstance().replaceDirectory();
-  const auto journals = fileManager().urlsForItemsInDirectoryAtURL(directory);
+  TSYFileManager::defaultManager().removeTemporaryFilesInDirectoryAtURL(directory);
+  const auto journals = TSYFileManager::defaultManager().urlsForItemsInDirectoryAtURL(directory);
   if (!journals) {
     if (!journals.error().isPosix(ENOENT)) {
       TSYLogWrite(TSYLogLevelError, "Failed to get items at replace URL {} : {}", directory.path(),
@@ -420,24 +275,30 @@ TSYResult<void> TSYClientConnection::_recoverFromReplaceOperations() {
 }
 
 TSYResult<void> TSYClientConnection::recoverFromReplaceOperation(const TSYURL& journal) {
-  const auto urls = _readAndValidateReplaceFileAtUrl(journal);
-  if (urls) {
-    const auto& [old, replacement, staging, destination] = *urls;
+  if (const auto urls = _readAndValidateReplaceFileAtUrl(journal)) {
     TSYLogWrite(TSYLogLevelDebug, "Doing a replace of {} with info: {}, {}, {}, {}", journal.path(),
-                old.path(), replacement.path(), staging.path(), destination.path());
-    if (!fileManager().itemExistsAtURL(old) && !fileManager().itemExistsAtURL(destination)) {
-      TSYLogWrite(TSYLogLevelDebug, "Recovering from failed replace by moving: {} to {}",
-                  staging.path(), old.path());
-      const auto moved = fileManager().moveItemAtURL(staging, old);
-      if (!moved) {
-        return TSYFailure(TSYErrorCreate(TSYErrorReplaceFileInvalid, moved.error(), TSYLogIt::yes,
-                                         "Failed to recover replace move: {} to {}", staging.path(),
-                                         old.path()));
-      }
-    }
+                urls->old.path(), urls->replacement.path(), urls->staging.path(),
+                urls->destination.path());
+    if (auto repaired = repairReplace(*urls); !repaired) return repaired;
   }
   const auto discarded = _moveItemAtURLToDeathRow(journal, /*startDeletionThread=*/false);
   if (discarded) return {};
   return TSYFailure(TSYErrorCreate(TSYErrorRemoveFileFailed, discarded.error(), TSYLogIt::yes,
                                    "Failed to remove replace file at {}", journal.path()));
+}
+
+TSYResult<void> TSYClientConnection::repairReplace(const ReplaceURLs& urls) {
+  TSYFileManager& files = TSYFileManager::defaultManager();
+  if (!files.itemExistsAtURL(urls.old) && !files.itemExistsAtURL(urls.destination)) {
+    TSYLogWrite(TSYLogLevelDebug, "Recovering from failed replace by moving: {} to {}",
+                urls.staging.path(), urls.old.path());
+    const auto moved = files.moveItemAtURL(urls.staging, urls.old);
+    if (!moved) {
+      return TSYFailure(TSYErrorCreate(TSYErrorReplaceFileInvalid, moved.error(), TSYLogIt::yes,
+                                       "Failed to recover replace move: {} to {}",
+                                       urls.staging.path(), urls.old.path()));
+    }
+  }
+  if (urls.destination == urls.old) tellApart(urls.old, urls.replacement);
+  return {};
 }

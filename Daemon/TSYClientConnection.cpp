@@ -1,5 +1,4 @@
 // The object itself, and what its caller may look up.
-
 #include "Daemon/TSYClientConnection.h"
 
 #include "Daemon/TSYCodeSigningMapping.h"
@@ -53,6 +52,10 @@ const std::string& TSYClientConnection::clientBundleIdentifier() const {
   return clientIdentity_ ? clientIdentity_->bundleIdentifier() : none;
 }
 
+TSYUserIdentityRef TSYClientConnection::clientUserIdentity() const {
+  return clientIdentity_ ? clientIdentity_->userIdentity() : nullptr;
+}
+
 TSYResult<void> TSYClientConnection::complete() {
   return commandQueue_->executeAllUntilExhausted();
 }
@@ -81,16 +84,21 @@ bool TSYClientConnection::isEntitledForLookupWithClass(TSYContainerClass contain
   return identifiers != nullptr && identifiers->contains(identifier);
 }
 
+bool TSYClientConnection::mayLookUpOf(TSYContainerClass containerClass,
+                                      const std::string& identifier) {
+  // A process without an identity owns nothing, not even the empty identifier.
+  const bool isOwn = clientIdentity_ && identifier == clientBundleIdentifier();
+  return isOwn || allowOtherIdLookup_ || unrestricted_ ||
+         isEntitledForLookupWithClass(containerClass, identifier) ||
+         TSYWhitelist::sharedWhitelist().isLookupWhitelistedFromCodeSignIdentifier(
+             clientBundleIdentifier(), containerClass, identifier);
+}
+
 bool TSYClientConnection::mayLookUp(const TSYContainerIdentity& identity) {
   const TSYContainerClass containerClass = identity.containerClass();
   const bool isGroup = containerClass == kTSYContainerClassAppGroup ||
                        containerClass == kTSYContainerClassSystemGroup;
-  // A process without an identity owns nothing, not even the empty identifier.
-  const bool isOwn = clientIdentity_ && identity.identifier() == clientBundleIdentifier();
-  return isOwn || allowOtherIdLookup_ || (isGroup && allowGroupIdLookup_) || unrestricted_ ||
-         isEntitledForLookupWithClass(containerClass, identity.identifier()) ||
-         TSYWhitelist::sharedWhitelist().isLookupWhitelistedFromCodeSignIdentifier(
-             clientBundleIdentifier(), containerClass, identity.identifier());
+  return (isGroup && allowGroupIdLookup_) || mayLookUpOf(containerClass, identity.identifier());
 }
 
 bool TSYClientConnection::mayLookUpSystemContainer(const TSYContainerIdentity& identity) {
@@ -129,5 +137,5 @@ TSYResult<std::vector<TSYMetadataRef>> TSYClientConnection::containersWithClass(
   }
   const TSYAllIdentifiersLock lock(TSYLockMode::reading, /*useLocking=*/true);
   return TSYContainerCache::sharedInstance().allContainersForUserIdentity(
-      clientIdentity_ ? clientIdentity_->userIdentity() : nullptr, containerClass, transient);
+      clientUserIdentity(), containerClass, transient);
 }

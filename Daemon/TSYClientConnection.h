@@ -56,6 +56,8 @@ class TSYClientConnection {
   const WipeIdentifiers& entitledWipeIdentifiers() const { return entitledWipeIdentifiers_; }
   // The client's code-signing identifier; empty without an identity.
   const std::string& clientBundleIdentifier() const;
+  // None without an identity.
+  TSYUserIdentityRef clientUserIdentity() const;
   void setAllowOtherIdLookup(bool allow) { allowOtherIdLookup_ = allow; }
   void setAllowGroupIdLookup(bool allow) { allowGroupIdLookup_ = allow; }
   void setUnrestricted(bool unrestricted) { unrestricted_ = unrestricted; }
@@ -67,12 +69,11 @@ class TSYClientConnection {
   bool isEntitledForLookupWithClass(TSYContainerClass containerClass,
                                     const std::string& identifier);
 
-  // --- Create or look up
-  // --------------------------------------------------------------------------
+  // --- Create or look up -------------------------------------------------------------------------
 
   // Finds the container, or creates it: built in a staging directory and moved into place whole.
   // existed() of the result tells which. A transient container is never reused: a second creation
-  // replaces it. With useLocking NO the caller holds the identifier locks.
+  // replaces it. With useLocking false the caller holds the identifier locks.
   //
   // Codes: 38 no identity, 55 not allowed, 21 not there and not to be created, 5, 7, 8, 9, 6, 45,
   // 40, and those of the cache (43, 46, 47), the metadata file, the identity and the access-control
@@ -85,8 +86,7 @@ class TSYClientConnection {
   TSYResult<std::vector<TSYMetadataRef>> containersWithClass(TSYContainerClass containerClass,
                                                              bool transient);
 
-  // --- Deletion
-  // -----------------------------------------------------------------------------------
+  // --- Deletion ----------------------------------------------------------------------------------
 
   // Takes an item out of sight: moves it into a new directory on death row. A missing item is
   // success. Code 41.
@@ -103,8 +103,7 @@ class TSYClientConnection {
   // and for one that the caller may not wipe, 55, or a code of lookup, creation or replace.
   uint64_t deleteDataContainerContentWithContainerIdentity(const TSYContainerIdentity& identity);
 
-  // --- Replace
-  // ------------------------------------------------------------------------------------
+  // --- Replace -----------------------------------------------------------------------------------
 
   // Puts the container `replacement` where `old` is, whose content goes to death row; with a plain
   // `old`, which names no container, makes it a regular one. With preserveOldUUID it takes the old
@@ -116,8 +115,7 @@ class TSYClientConnection {
                                     const TSYConcreteContainerIdentity& replacement,
                                     bool preserveOldUUID, bool startDeletionThread);
 
-  // --- Info values and queries
-  // --------------------------------------------------------------------
+  // --- Info values and queries -------------------------------------------------------------------
   // Each fails with code 21 when the very container is not there.
 
   // Sets a value of the container's info dictionary; none removes the key. Codes 38 without a key,
@@ -146,8 +144,7 @@ class TSYClientConnection {
       const std::string& ownerIdentifier, const TSYUserIdentityRef& userIdentity,
       TSYContainerClass groupContainerClass);
 
-  // --- Boot
-  // ---------------------------------------------------------------------------------------
+  // --- Boot --------------------------------------------------------------------------------------
 
   // Run at every start, before any request is served: repairs replaces that were cut short.
   void tessarySetup();
@@ -163,6 +160,8 @@ class TSYClientConnection {
 
   TSYResult<void> checkAccess(const TSYContainerIdentity& identity);
   bool mayLookUp(const TSYContainerIdentity& identity);
+  // The part of the rule that holds for a container and for the owner of groups.
+  bool mayLookUpOf(TSYContainerClass containerClass, const std::string& identifier);
   bool mayLookUpSystemContainer(const TSYContainerIdentity& identity);
   const IdentifierSet* _lookupForContainerClass(TSYContainerClass containerClass);
 
@@ -209,6 +208,7 @@ class TSYClientConnection {
   static TSYResult<ReplaceURLs> _readAndValidateReplaceFileAtUrl(const TSYURL& journal);
   static TSYResult<void> _recoverFromReplaceOperations();
   static TSYResult<void> recoverFromReplaceOperation(const TSYURL& journal);
+  static TSYResult<void> repairReplace(const ReplaceURLs& urls);
 
   TSYResult<void> checkGroupAccess(const std::string& ownerIdentifier,
                                    TSYContainerClass groupContainerClass);

@@ -31,7 +31,7 @@ uint64_t TSYHandleCreateOrLookup(TSYRelayEvent& event, TSYClientConnection& conn
 
 uint64_t TSYHandleContainersOfClass(TSYRelayEvent& event, TSYClientConnection& connection) {
   const auto containers =
-      connection.containersWithClass(event.request.uint64("ContainerClass").value_or(0),
+      connection.containersWithClass(event.request.uint64(kTSYRequestContainerClass).value_or(0),
                                      event.request.boolean("Transient").value_or(false));
   if (!containers) return containers.error().clientCode();
   Value::Array identifiers;
@@ -77,8 +77,7 @@ uint64_t TSYHandlePersonaList(TSYRelayEvent& event, TSYClientConnection& connect
     }
   };
   // A process without an identity has no persona, and is told of none.
-  const TSYUserIdentityRef own =
-      connection.clientIdentity() ? connection.clientIdentity()->userIdentity() : nullptr;
+  const TSYUserIdentityRef own = connection.clientUserIdentity();
   if (own && own->isNoSpecificPersona()) {
     TSYUserIdentitySharedCache::sharedInstance()
         .forEachAccessibleUserIdentitySynchronouslyExecuteBlock(add);

@@ -1,5 +1,6 @@
 #include "Daemon/TSYCommandStageForDelete.h"
 
+#include "Daemon/TSYCacheSteps.h"
 #include "Daemon/TSYClientConnection.h"
 #include "Daemon/TSYCodeSigningMapping.h"
 #include "Daemon/TSYContainerCache.h"
@@ -53,14 +54,7 @@ TSYResult<void> stage(const TSYMetadata& container, TSYCommandQueue& queue) {
   }
   // A container that resists stays as it is, and is no failure of the command.
   if (!takeOutOfSight(container.url())) return {};
-  const auto removed = TSYContainerCache::sharedInstance().removeContainerForUserIdentity(
-      container.userIdentity(), container.containerClass(), container.identifier(),
-      container.transient());
-  if (removed) return {};
-  return TSYFailure(TSYErrorCreate(TSYErrorCacheRemoveFailed, removed.error(), TSYLogIt::yes,
-                                   "Failed to remove from cache id: {}, class: {}, transient: {:d}",
-                                   container.identifier(), container.containerClass(),
-                                   container.transient()));
+  return TSYRemoveFromCache(container);
 }
 
 }  // namespace

@@ -15,7 +15,7 @@ class TSYCommandStageForDelete : public TSYCommand {
   using OnError = std::function<void(uint64_t code)>;
 
   // A concrete identity means that very container, a plain one the regular container of its name;
-  // one that is not there is passed over. With useLocking NO whoever makes the command holds the
+  // one that is not there is passed over. With useLocking false whoever makes the command holds the
   // all-identifiers write lock when it runs. `onError`, which may be null, is told the code of a
   // command that fails: 46, 40.
   TSYCommandStageForDelete(std::vector<TSYContainerIdentityRef> containerIdentities,

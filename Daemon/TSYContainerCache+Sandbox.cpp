@@ -1,5 +1,4 @@
 // What the kernel sandbox is told of the containers.
-
 #include "Daemon/TSYCodeSigningMapping.h"
 #include "Daemon/TSYContainerCache.h"
 #include "Daemon/TSYException.h"

@@ -213,6 +213,21 @@ TSYResult<void> TSYFileManager::removeItemAtURL(const TSYURL& url) {
                                         removed.error().message()));
 }
 
+TSYResult<void> TSYFileManager::syncDirectoryOfItemAtURL(const TSYURL& url) {
+  const TSYURL directory = url.deletingLastPathComponent();
+  const auto synced = files().syncDirectory(directory.path());
+  if (synced) return {};
+  return TSYFailure(TSYPosixErrorCreate(synced.error(), "fsync of {} failed: {}", directory.path(),
+                                        synced.error().message()));
+}
+
+void TSYFileManager::removeTemporaryFilesInDirectoryAtURL(const TSYURL& url) {
+  const auto removed = files().removeTemporaryFiles(url.path());
+  if (removed) return;
+  TSYLogWrite(TSYLogLevelError, "Failed to remove temporary files in {}: {}", url.path(),
+              removed.error().message());
+}
+
 TSYResult<TSYURL> TSYFileManager::createTemporaryDirectoryInDirectoryURL(
     const TSYURL& parent, const std::string& prefix) {
   auto made = files().makeTemporaryDirectory(parent.path(), prefix);

@@ -48,6 +48,12 @@ class TSYFileManager {
   // item is success.
   TSYResult<void> removeItemAtURL(const TSYURL& url);
 
+  // What has been renamed into the item's directory stays there after a power cut.
+  TSYResult<void> syncDirectoryOfItemAtURL(const TSYURL& url);
+  // Removes what writes that were cut short have left in a directory that nobody is writing into.
+  // Failures are logged.
+  void removeTemporaryFilesInDirectoryAtURL(const TSYURL& url);
+
   // A new, uniquely named directory in `parent`.
   TSYResult<TSYURL> createTemporaryDirectoryInDirectoryURL(const TSYURL& parent,
                                                            const std::string& prefix = "temp.");

@@ -16,7 +16,7 @@ class TSYGroupManager {
   static TSYGroupManager& defaultManager();
 
   // The identifiers of the groups that an owner is entitled to: system groups for class 13, else
-  // application groups. With useLocking NO the caller holds the identifier locks. Code 40.
+  // application groups. With useLocking false the caller holds the identifier locks. Code 40.
   TSYResult<std::vector<std::string>> groupContainerIdentifiersForOwnerIdentifier(
       const std::string& ownerIdentifier, TSYContainerClass groupContainerClass, bool useLocking);
 };

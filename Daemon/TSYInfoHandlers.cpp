@@ -1,5 +1,4 @@
 // Commands that read or change one existing container.
-
 #include "Daemon/TSYCommandHandlers.h"
 #include "Daemon/TSYLog.h"
 #include "Daemon/TSYRequestResolvers.h"

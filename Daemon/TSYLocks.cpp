@@ -1,7 +1,6 @@
 // One table for the process, under one mutex that is never held while waiting for a container: who
 // holds one identifier for long blocks nobody else's work. A record exists from the first lock of
 // its identifier to the last unlock.
-
 #include "Daemon/TSYLocks.h"
 
 #include <algorithm>

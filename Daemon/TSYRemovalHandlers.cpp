@@ -1,5 +1,4 @@
 // Commands that take containers away or put others in their place.
-
 #include "Daemon/TSYCommandHandlers.h"
 #include "Daemon/TSYCommandStageForDelete.h"
 #include "Daemon/TSYLog.h"
@@ -40,8 +39,10 @@ TSYResolved<TSYUserIdentityRef> ownerAt(const StagingArrays& arrays, size_t inde
   if (!TSYUserIdentity::isUserIdentityRequiredForContainerClass(containerClass)) {
     return TSYUserIdentitySharedCache::sharedInstance().userIdentityForCurrentContext();
   }
+  // As in a listing, the empty string stands for none.
   const std::string* persona = arrays.personas[index].asString();
-  return TSYResolvePersona(connection, persona == nullptr ? std::nullopt : std::optional(*persona));
+  const bool isNone = persona == nullptr || persona->empty();
+  return TSYResolvePersona(connection, isNone ? std::nullopt : std::optional(*persona));
 }
 
 TSYResolved<TSYContainerIdentityRef> identityAt(const StagingArrays& arrays, size_t index,

@@ -30,10 +30,6 @@ std::string descriptionOf(const TSYUserIdentityCache::IdentitySet& identities) {
   return text + ")}";
 }
 
-TSYUserIdentityRef clientsUser(const TSYClientConnection& connection) {
-  return connection.clientIdentity() ? connection.clientIdentity()->userIdentity() : nullptr;
-}
-
 // The bundle whose personas decide: plug-ins follow the application that they belong to.
 std::string bundleIdentifierFor(const std::string& identifier, TSYContainerClass containerClass) {
   if (containerClass != kTSYContainerClassPluginData &&
@@ -69,7 +65,7 @@ TSYResolved<NamedContainer> resolveNamed(const Message& request,
   if (!identifier) return std::unexpected(uint64_t{TSYErrorMissingIdentifier});
   const auto containerClass = resolveClass(request, keys.containerClass);
   if (!containerClass) return std::unexpected(containerClass.error());
-  NamedContainer named{std::move(*identifier), *containerClass, clientsUser(connection)};
+  NamedContainer named{std::move(*identifier), *containerClass, connection.clientUserIdentity()};
   if (TSYUserIdentity::isUserIdentityRequiredForContainerClass(*containerClass)) {
     auto persona = TSYResolvePersona(connection, stringUnder(request, keys.persona));
     if (!persona) return std::unexpected(persona.error());
@@ -106,7 +102,7 @@ std::optional<std::string> TSYResolveIdentifier(const Message& request,
 TSYResolved<TSYUserIdentityRef> TSYResolveUserIdentityForIdentifier(
     const TSYClientConnection& connection, const std::string& identifier,
     TSYContainerClass containerClass) {
-  const TSYUserIdentityRef own = clientsUser(connection);
+  TSYUserIdentityRef own = connection.clientUserIdentity();
   if (!own) return std::unexpected(uint64_t{TSYErrorPersonaMismatch});
   if (!TSYIsPerUserClass(containerClass) || !own->isNoSpecificPersona()) return own;
 
@@ -148,7 +144,7 @@ TSYResolved<TSYContainerIdentity> TSYResolveContainerIdentity(const Message& req
 
 TSYResolved<TSYUserIdentityRef> TSYResolvePersona(const TSYClientConnection& connection,
                                                   const std::optional<std::string>& uniqueString) {
-  const TSYUserIdentityRef own = clientsUser(connection);
+  TSYUserIdentityRef own = connection.clientUserIdentity();
   if (!own) return std::unexpected(uint64_t{TSYErrorPersonaMismatch});
   if (Platform::current().device.isMultiUser()) return own;
   auto identity = TSYUserIdentitySharedCache::sharedInstance()

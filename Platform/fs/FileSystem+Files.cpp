@@ -91,4 +91,19 @@ Result<void> FileSystem::writeFile(const std::string& path, std::span<const uint
   return {};
 }
 
+Result<void> FileSystem::removeTemporaryFiles(const std::string& directory) const {
+  const auto entries = list(directory);
+  if (!entries && entries.error() == Errno{ENOENT}) return {};
+  if (!entries) return std::unexpected(entries.error());
+  for (const DirectoryEntry& entry : *entries) {
+    if (!entry.name.starts_with(kTemporaryPrefix)) continue;
+    const auto place = locate(directory + "/" + entry.name);
+    if (!place) return std::unexpected(place.error());
+    if (::unlinkat(place->parent.get(), place->name.c_str(), 0) != 0 && errno != ENOENT) {
+      return lastErrno();
+    }
+  }
+  return {};
+}
+
 }  // namespace platform

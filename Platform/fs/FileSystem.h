@@ -96,6 +96,9 @@ class FileSystem {
   // atomic, and before the call returns when not. What stands at the name is never written through.
   Result<void> writeFile(const std::string& path, std::span<const uint8_t> bytes,
                          const WriteOptions& options) const;
+  // Removes the files that atomic writes which were cut short have left in a directory, into which
+  // nobody may be writing. A missing directory is success.
+  Result<void> removeTemporaryFiles(const std::string& directory) const;
   // fsync(2) of a directory: what was renamed into it stays after a power cut.
   Result<void> syncDirectory(const std::string& path) const;
 

@@ -20,7 +20,7 @@ Result<std::string> randomName(std::string prefix, size_t characters) {
 }
 
 Result<std::string> temporarySiblingName() {
-  return randomName(".tmp.", 16);
+  return randomName(kTemporaryPrefix, 16);
 }
 
 }  // namespace platform

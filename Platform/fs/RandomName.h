@@ -11,6 +11,7 @@ namespace platform {
 Result<std::string> randomName(std::string prefix, size_t characters);
 
 // The name of something that will be renamed into place: dot-named, so that listings hide it.
+inline constexpr char kTemporaryPrefix[] = ".tmp.";
 Result<std::string> temporarySiblingName();
 
 // How often a name that turns out to be taken is drawn anew before EEXIST is answered.

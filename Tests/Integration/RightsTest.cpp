@@ -178,7 +178,7 @@ TEST_F(Rights, OfEachEntitlementOverTheRows) {
       {"lookup", Caller().with("lookup", Dictionary{}), {1, 14, 23}},
       {"otherIdLookup", Caller().with("otherIdLookup"), {}},
       {"userManagedAssets", Caller().with("userManagedAssets"), {4, 28, 29}},
-      {"wipeContainer, a list", Caller().with("wipeContainer", Array{}), {11}},
+      {"wipeContainer, a list", Caller().with("wipeContainer", Array{"com.veltra.exampled"}), {11}},
       {"wipeContainer, no list", Caller().with("wipeContainer"), {}},
       {"deleteContainerContent", Caller().with("deleteContainerContent"), {12}},
       {"dataMigration", Caller().with("dataMigration"), {24}},
@@ -187,7 +187,8 @@ TEST_F(Rights, OfEachEntitlementOverTheRows) {
       {"allowed", Caller().with("allowed"), ordinary},
   };
   // The rows that have an operation; the others say so to whoever may use them.
-  const std::vector<uint64_t> built = {0, 1, 15, 27, 32};
+  const std::vector<uint64_t> built = {0, 1,  2,  3,  4,  5,  6,  7,  8,
+                                       9, 10, 11, 12, 15, 22, 23, 27, 32};
   for (const auto& grant : kGrants) {
     tessary::Client client = device_->connect(grant.caller);
     for (uint64_t command = 0; command < kCommandCount; ++command) {

@@ -1,5 +1,4 @@
 // tessaryctl: one subcommand per command of the protocol.
-
 #include <CLI/CLI.hpp>
 
 #include "Client/Client.h"
