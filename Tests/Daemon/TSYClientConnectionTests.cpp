@@ -6,33 +6,9 @@
 #include <linux/fs.h>
 #include <sys/ioctl.h>
 
-#include <cstdlib>
 #include <future>
-#include <new>
 
 #include "Tests/Daemon/ContainerDevice.h"
-
-namespace {
-
-// How many allocations of this thread still succeed before one fails; negative for all of them.
-thread_local int allocationsBeforeFailure = -1;
-
-}  // namespace
-
-void* operator new(size_t size) {
-  if (allocationsBeforeFailure >= 0 && allocationsBeforeFailure-- == 0) throw std::bad_alloc();
-  if (void* memory = std::malloc(size)) return memory;
-  throw std::bad_alloc();
-}
-void* operator new(size_t size, const std::nothrow_t& /*tag*/) noexcept {
-  return std::malloc(size);
-}
-void operator delete(void* memory) noexcept {
-  std::free(memory);
-}
-void operator delete(void* memory, size_t /*size*/) noexcept {
-  std::free(memory);
-}
 
 namespace {
 
@@ -40,40 +16,6 @@ using testing::IsEmpty;
 
 const std::string kCaches = "/private/var/root/Library/Caches/com.veltra.tessaryd";
 const std::string kDeathRow = kCaches + "/Dead";
-
-TSYUserIdentityRef mobile() {
-  return TSYUserIdentitySharedCache::sharedInstance().userIdentityForPersonalPersona();
-}
-
-// Whichever allocation fails, the request fails and not the process, and the next one finds nothing
-// half-built in its way.
-TEST(TSYClientConnection, anExceptionBecomesAnErrorWhereverItIsThrown) {
-  // At the level of the daemon: lines for debugging are also written where locks are released.
-  const ContainerDevice device(std::nullopt, {}, TSYLogLevelNotice);
-  const auto client = TSYClientConnection::privilegedClientConnectionWithUserIdentity(mobile());
-  const auto make = [&](const std::string& identifier, int allocations) {
-    const std::optional<TSYContainerIdentity> identity = containerOf(mobile(), identifier, 2);
-    allocationsBeforeFailure = allocations;
-    auto made = client->createOrLookupContainerWithContainerIdentity(
-        identity, /*createIfNecessary=*/true, /*transient=*/false, /*useLocking=*/true);
-    allocationsBeforeFailure = -1;
-    return made;
-  };
-  ASSERT_TRUE(make("com.example.first", -1).has_value());  // shared instances and class directories
-  int failures = 0;
-  for (int allocations = 0;; allocations += 7) {
-    const std::string identifier = "com.example.app" + std::to_string(allocations);
-    const auto made = make(identifier, allocations);
-    if (made) break;
-    if (made.error().is(TSYErrorException)) ++failures;
-    ASSERT_TRUE(make(identifier, -1).has_value()) << allocations;
-  }
-  EXPECT_GT(failures, 10);
-  const std::string live = "/private/var/mobile/Containers/Data/Application/";
-  for (const std::string& name : device.namesIn(live)) {
-    EXPECT_EQ(device.namesIn(live + name).size(), 5U) << "half-built: " << name;
-  }
-}
 
 uint64_t emptyDeathRow() {
   std::promise<uint64_t> code;
