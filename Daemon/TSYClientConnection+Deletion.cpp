@@ -1,5 +1,7 @@
 // Death row: what is to be deleted is renamed out of sight first and removed later, by one task at
 // a time on a queue of its own. Nothing on death row is ever read back.
+#include <sys/stat.h>
+
 #include <algorithm>
 
 #include "Daemon/TSYClientConnection.h"
@@ -27,7 +29,18 @@ TSYResult<void> moveIntoOwnDirectory(const TSYURL& url) {
     return TSYFailure(TSYErrorCreate(TSYErrorFileOperationFailed, directory.error(), TSYLogIt::yes,
                                      "Failed to create unique directory at: {}", url.path()));
   }
-  return files.renameItemAtURL(url, directory->appending(url.lastPathComponent()));
+  const TSYURL target = directory->appending(url.lastPathComponent());
+  auto moved = files.renameItemAtURL(url, target);
+  for (int attempt = 1; attempt < kAttempts; ++attempt) {
+    if (moved || !moved.error().isPosix(ENOENT)) break;
+    // What is gone already counts as deleted.
+    if (files.itemDoesNotExistAtURL(url)) return {};
+    (void)files.createDirectoryAtURL(*directory, /*withIntermediateDirectories=*/false, S_IRWXU);
+    moved = files.renameItemAtURL(url, target);
+  }
+  if (moved || files.itemDoesNotExistAtURL(url)) return {};
+  return TSYFailure(TSYErrorCreate(TSYErrorFileOperationFailed, moved.error(), TSYLogIt::yes,
+                                   "Failed to move item at: {} to: {}", url.path(), target.path()));
 }
 
 TSYResult<void> removeWhole(const TSYURL& url) {
@@ -45,21 +58,8 @@ TSYResult<void> removeWhole(const TSYURL& url) {
 TSYResult<void> TSYClientConnection::_moveItemAtURLToDeathRow(const TSYURL& url,
                                                               bool startDeletionThread) {
   auto moved = moveIntoOwnDirectory(url);
-  for (int attempt = 1; attempt < kAttempts; ++attempt) {
-    if (moved || !moved.error().isPosix(ENOENT)) break;
-    // What is gone already counts as deleted.
-    if (TSYFileManager::defaultManager().itemDoesNotExistAtURL(url)) return {};
-    moved = moveIntoOwnDirectory(url);
-  }
-  if (!moved && moved.error().is(TSYErrorFileOperationFailed)) return moved;
-  if (!moved) {
-    return TSYFailure(
-        TSYErrorCreate(TSYErrorFileOperationFailed, moved.error(), TSYLogIt::yes,
-                       "Failed to move item at: {} to: {}", url.path(),
-                       TSYGlobalConfiguration::sharedInstance().deathrowDirectory().path()));
-  }
-  if (startDeletionThread) deleteContainersOnDeathRowWithCompletion(nullptr);
-  return {};
+  if (moved && startDeletionThread) deleteContainersOnDeathRowWithCompletion(nullptr);
+  return moved;
 }
 
 void TSYClientConnection::deleteContainersOnDeathRowWithCompletion(

@@ -36,9 +36,10 @@ TSYMetadata::Info withValue(const TSYMetadata::Info& info, const std::string& ke
 
 // The one ordinary system group whose directory keeps its name, and those whose name is fixed.
 bool keepsItsDirectoryName(const TSYMetadata& container) {
-  return container.identifier() == kAnalyticsGroup ||
-         TSYWhitelist::sharedWhitelist().containerIdIsWellknown(container.identifier(),
-                                                                container.containerClass());
+  const bool isAnalytics = container.containerClass() == kTSYContainerClassSystemGroup &&
+                           container.identifier() == kAnalyticsGroup;
+  return isAnalytics || TSYWhitelist::sharedWhitelist().containerIdIsWellknown(
+                            container.identifier(), container.containerClass());
 }
 
 bool isMeasuredOnce(TSYContainerClass containerClass) {
@@ -131,7 +132,11 @@ TSYResult<void> TSYClientConnection::regenerateDirectoryUUID(
                                      "Failed to move dir: {} to new UUID dir: {}", url.path(),
                                      newURL.path()));
   }
-  return TSYAddToCache(**container, newURL, (*container)->transient(), /*updateSandbox=*/true);
+  auto added =
+      TSYAddToCache(**container, newURL, (*container)->transient(), /*updateSandbox=*/true);
+  // What the cache does not know must not be there under another name than it knows.
+  if (!added) (void)TSYFileManager::defaultManager().renameItemAtURL(newURL, url);
+  return added;
 }
 
 void TSYClientConnection::_regenerateAllSystemContainerPaths() {
@@ -173,7 +178,7 @@ TSYResult<uint64_t> TSYClientConnection::diskUsage(const TSYConcreteContainerIde
     container = std::move(*found);
     if (isMeasuredOnce(container->containerClass())) {
       const auto known = infoValueForKey(kStaticDiskUsageKey, identity, /*useLocking=*/false);
-      if (known && known->isNumber()) return known->unsignedOfNumber().value_or(0);
+      if (known && known->asUInt64()) return *known->asUInt64();
       if (!known && !known.error().is(TSYErrorInfoValueNotFound)) {
         TSYLogWrite(TSYLogLevelError, "Error looking up info value for identity: {}: {}",
                     identity.description(), known.error().code());

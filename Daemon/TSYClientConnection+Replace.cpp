@@ -80,7 +80,7 @@ TSYResult<TSYURL> freeDestination(const TSYMetadata* old, const TSYMetadata& rep
 }
 
 // A container that becomes a regular one must be the only one of its name.
-TSYResult<void> checkNoRegularContainer(const TSYConcreteContainerIdentity& identity) {
+TSYResult<void> checkNoOtherRegular(const TSYConcreteContainerIdentity& identity) {
   const auto found = TSYContainerCache::sharedInstance().containerForContainerIdentity(
       static_cast<const TSYContainerIdentity&>(identity), /*transient=*/false,
       /*updateSandbox=*/true);
@@ -126,19 +126,38 @@ void tellApart(const TSYURL& old, const TSYURL& replacement) {
   TSYLogWrite(TSYLogLevelError, "Failed to give {} another UUID: {}", file.path(), written.error());
 }
 
-// After a replace and one that was undone: what is left in staging is garbage.
+// Out of sight, or removed where it is when death row cannot take it.
+TSYResult<void> getRidOf(const TSYURL& url, bool startDeletionThread) {
+  auto moved = TSYClientConnection::_moveItemAtURLToDeathRow(url, startDeletionThread);
+  if (moved) return moved;
+  return TSYFileManager::defaultManager().removeItemAtURL(url);
+}
+
+// After a replace and one that was undone: what is left in staging is garbage. The journal goes
+// whatever becomes of it; with the journal the next start might take it for a lost container.
 TSYResult<void> discard(const TSYURL& staging, const TSYURL& journal, bool startDeletionThread) {
-  auto moved =
-      TSYClientConnection::_moveItemAtURLToDeathRow(staging, /*startDeletionThread=*/false);
-  if (!moved) {
-    // The journal stays: while it is there nobody takes the staging directory for a leftover.
-    return TSYFailure(TSYErrorCreate(TSYErrorRemoveFileFailed, moved.error(), TSYLogIt::yes,
+  const auto stagingGone = getRidOf(staging, /*startDeletionThread=*/false);
+  const auto journalGone = getRidOf(journal, startDeletionThread);
+  if (!stagingGone) {
+    return TSYFailure(TSYErrorCreate(TSYErrorRemoveFileFailed, stagingGone.error(), TSYLogIt::yes,
                                      "Failed to remove staging dir: {}", staging.path()));
   }
-  moved = TSYClientConnection::_moveItemAtURLToDeathRow(journal, startDeletionThread);
-  if (moved) return {};
-  return TSYFailure(TSYErrorCreate(TSYErrorRemoveFileFailed, moved.error(), TSYLogIt::yes,
+  if (journalGone) return {};
+  return TSYFailure(TSYErrorCreate(TSYErrorRemoveFileFailed, journalGone.error(), TSYLogIt::yes,
                                    "Failed to remove replace file: {}", journal.path()));
+}
+
+// Whether a file could not be read for reasons that say nothing about what is in it.
+bool maySucceedLater(const TSYError& error) {
+  const auto& underlying = error.underlying();
+  return underlying && (underlying->isPosix(EIO) || underlying->isPosix(EMFILE) ||
+                        underlying->isPosix(ENFILE) || underlying->isPosix(ENOMEM));
+}
+
+// What a message says of a path.
+const std::string& textOf(const TSYURL& url) {
+  static const std::string none = "(null)";
+  return url.path().empty() ? none : url.path();
 }
 
 }  // namespace
@@ -170,10 +189,13 @@ TSYResult<void> TSYClientConnection::replace(const TSYContainerIdentity& old,
   const auto destination = preserveOldUUID ? TSYResult<TSYURL>(oldContainer->url())
                                            : freeDestination(oldContainer.get(), **newContainer);
   if (!destination) return TSYFailure(destination.error());
-  if (!oldContainer) {
-    if (auto valid = checkNoRegularContainer(replacement); !valid) return valid;
-    return promote(*newContainer, *destination);
+  const bool takesNewName =
+      !oldContainer ||
+      (!oldContainer->transient() && oldContainer->identifier() != replacement.identifier());
+  if (takesNewName) {
+    if (auto valid = checkNoOtherRegular(replacement); !valid) return valid;
   }
+  if (!oldContainer) return promote(*newContainer, *destination);
   return replaceJournalled(oldContainer, *newContainer, *destination, preserveOldUUID,
                            startDeletionThread);
 }
@@ -197,13 +219,20 @@ TSYResult<void> TSYClientConnection::replaceJournalled(const TSYMetadataRef& old
                                   preserveOldUUID ? std::optional(old->uuid()) : std::nullopt,
                                   staging, destination);
     result = exchange.run();
-    // The old container is in staging still: the next start puts it back.
+    // The journal stays: the next start does what could not be done now.
     if (!result && !exchange.undo()) return result;
   } else {
     TSYLogWrite(TSYLogLevelError, "Failed to write replace file: {}", journal.path());
   }
   auto discarded = discard(staging, journal, startDeletionThread);
   return result ? std::move(discarded) : std::move(result);
+}
+
+Value::Dictionary TSYClientConnection::dictionaryOf(const ReplaceURLs& urls) {
+  return {{kOldURLKey, urls.old.path()},
+          {kNewURLKey, urls.replacement.path()},
+          {kStagingURLKey, urls.staging.path()},
+          {kDestinationURLKey, urls.destination.path()}};
 }
 
 TSYResult<void> TSYClientConnection::_writeToDiskReplaceAt(const TSYURL& journal,
@@ -214,13 +243,10 @@ TSYResult<void> TSYClientConnection::_writeToDiskReplaceAt(const TSYURL& journal
     return TSYFailure(
         TSYErrorCreate(TSYErrorInvalidReplaceInfo, std::nullopt, TSYLogIt::yes,
                        "Invalid Replace File Info: old: {}, new: {}, staging: {}, dest: {}",
-                       old.path(), replacement.path(), staging.path(), destination.path()));
+                       textOf(old), textOf(replacement), textOf(staging), textOf(destination)));
   }
-  auto written = TSY_writeToURL({{kOldURLKey, old.path()},
-                                 {kNewURLKey, replacement.path()},
-                                 {kStagingURLKey, staging.path()},
-                                 {kDestinationURLKey, destination.path()}},
-                                journal, kTSYWriteAtomic | kTSYWriteProtectionNone);
+  auto written =
+      TSY_writeToURL(dictionaryOf(urls), journal, kTSYWriteAtomic | kTSYWriteProtectionNone);
   if (written) written = TSYFileManager::defaultManager().syncDirectoryOfItemAtURL(journal);
   if (written) return {};
   return TSYFailure(TSYErrorCreate(TSYErrorWriteFailed, written.error(), TSYLogIt::yes,
@@ -275,10 +301,11 @@ TSYResult<void> TSYClientConnection::_recoverFromReplaceOperations() {
 }
 
 TSYResult<void> TSYClientConnection::recoverFromReplaceOperation(const TSYURL& journal) {
-  if (const auto urls = _readAndValidateReplaceFileAtUrl(journal)) {
-    TSYLogWrite(TSYLogLevelDebug, "Doing a replace of {} with info: {}, {}, {}, {}", journal.path(),
-                urls->old.path(), urls->replacement.path(), urls->staging.path(),
-                urls->destination.path());
+  const auto urls = _readAndValidateReplaceFileAtUrl(journal);
+  if (!urls && maySucceedLater(urls.error())) return TSYFailure(urls.error());
+  if (urls) {
+    TSYLogWrite(TSYLogLevelDebug, "Doing a replace of {} with info: {}", journal.path(),
+                Value(dictionaryOf(*urls)).description());
     if (auto repaired = repairReplace(*urls); !repaired) return repaired;
   }
   const auto discarded = _moveItemAtURLToDeathRow(journal, /*startDeletionThread=*/false);
@@ -289,10 +316,14 @@ TSYResult<void> TSYClientConnection::recoverFromReplaceOperation(const TSYURL& j
 
 TSYResult<void> TSYClientConnection::repairReplace(const ReplaceURLs& urls) {
   TSYFileManager& files = TSYFileManager::defaultManager();
-  if (!files.itemExistsAtURL(urls.old) && !files.itemExistsAtURL(urls.destination)) {
+  const bool isOldAside = files.itemDoesNotExistAtURL(urls.old) &&
+                          files.itemDoesNotExistAtURL(urls.destination) &&
+                          !files.itemDoesNotExistAtURL(urls.staging);
+  if (isOldAside) {
     TSYLogWrite(TSYLogLevelDebug, "Recovering from failed replace by moving: {} to {}",
                 urls.staging.path(), urls.old.path());
-    const auto moved = files.moveItemAtURL(urls.staging, urls.old);
+    auto moved = files.renameItemAtURL(urls.staging, urls.old);
+    if (moved) moved = files.syncDirectoryOfItemAtURL(urls.old);
     if (!moved) {
       return TSYFailure(TSYErrorCreate(TSYErrorReplaceFileInvalid, moved.error(), TSYLogIt::yes,
                                        "Failed to recover replace move: {} to {}",

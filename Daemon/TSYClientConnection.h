@@ -204,6 +204,7 @@ class TSYClientConnection {
   TSYResult<void> replaceJournalled(const TSYMetadataRef& old, const TSYMetadataRef& replacement,
                                     const TSYURL& destination, bool preserveOldUUID,
                                     bool startDeletionThread);
+  static platform::Value::Dictionary dictionaryOf(const ReplaceURLs& urls);
   static TSYResult<void> _writeToDiskReplaceAt(const TSYURL& journal, const ReplaceURLs& urls);
   static TSYResult<ReplaceURLs> _readAndValidateReplaceFileAtUrl(const TSYURL& journal);
   static TSYResult<void> _recoverFromReplaceOperations();

@@ -18,7 +18,12 @@ TSYContainerExchange::TSYContainerExchange(TSYMetadataRef old, TSYMetadataRef re
       destination_(std::move(destination)) {}
 
 TSYContainerExchange::~TSYContainerExchange() {
-  if (!over_ && !undo()) std::abort();
+  if (over_) return;
+  if (isOldStaged_) {
+    TSYLogWrite(TSYLogLevelDebug, "Recovering from exception by moving: {} to {}", staging_.path(),
+                old_->url().path());
+  }
+  if (!undo()) std::abort();
 }
 
 TSYResult<void> TSYContainerExchange::run() {
@@ -33,23 +38,33 @@ TSYResult<void> TSYContainerExchange::run() {
 bool TSYContainerExchange::undo() {
   over_ = true;
   if (isReplacementMoved_) takeReplacementBack();
-  if (isUUIDWritten_ && !replacement_->writeMetadataToDisk()) {
-    TSYLogWrite(TSYLogLevelError, "Failed to give {} its UUID back", replacement_->url().path());
+  bool isUndone = !isUUIDWritten_ || restoreUUID();
+  if (isOldStaged_) {
+    const bool isOldBack = putOldBack();
+    if (isOldBack && isOldDropped_) {
+      (void)TSYAddToCache(*old_, old_->url(), old_->transient(), /*updateSandbox=*/true);
+    }
+    isUndone = isUndone && isOldBack && isOnDisk(old_->url());
   }
-  const bool isOldBack = !isOldStaged_ || putOldBack();
-  if (isOldDropped_ && isOldBack) {
-    (void)TSYAddToCache(*old_, old_->url(), old_->transient(), /*updateSandbox=*/true);
-  }
-  if (isReplacementDropped_ &&
-      TSYFileManager::defaultManager().itemExistsAtURL(replacement_->url())) {
-    (void)TSYAddToCache(*replacement_, replacement_->url(), replacement_->transient(),
-                        /*updateSandbox=*/true);
-  }
-  return isOldBack;
+  return isUndone;
 }
 
+bool TSYContainerExchange::restoreUUID() {
+  if (replacement_->writeMetadataToDisk()) return true;
+  TSYLogWrite(TSYLogLevelError, "Failed to give {} its UUID back", replacement_->url().path());
+  return false;
+}
+
+bool TSYContainerExchange::isOnDisk(const TSYURL& url) {
+  const auto synced = TSYFileManager::defaultManager().syncDirectoryOfItemAtURL(url);
+  if (synced) return true;
+  TSYLogWrite(TSYLogLevelError, "{} may be lost with the power: {}", url.path(), synced.error());
+  return false;
+}
+
+// One rename and never a copy: what is cut short then has done all of it or nothing.
 TSYResult<void> TSYContainerExchange::takeOldAside() {
-  const auto moved = TSYFileManager::defaultManager().moveItemAtURL(old_->url(), staging_);
+  const auto moved = TSYFileManager::defaultManager().renameItemAtURL(old_->url(), staging_);
   if (!moved) {
     return TSYFailure(TSYErrorCreate(TSYErrorReplaceStageOldFailed, moved.error(), TSYLogIt::yes,
                                      "Failed to move old {} to staging {}", old_->url().path(),
@@ -94,21 +109,29 @@ TSYResult<void> TSYContainerExchange::moveReplacement() {
       old_ ? old_->url().path() : "(null)", replacement_->url().path(), destination_.path()));
 }
 
-// The destination must be free for the old container, if need be at the cost of the new one.
+// Where the old container has to go the new one must not stay, even if it is lost.
 void TSYContainerExchange::takeReplacementBack() {
-  const auto moved =
-      TSYFileManager::defaultManager().moveItemAtURL(destination_, replacement_->url());
-  if (moved) return;
-  TSYLogWrite(TSYLogLevelError, "Failed to move {} back to {}: {}", destination_.path(),
-              replacement_->url().path(), moved.error());
+  const TSYURL url = replacement_->url();
+  const auto moved = TSYFileManager::defaultManager().moveItemAtURL(destination_, url);
+  if (moved) return reenterReplacement(url);
+  TSYLogWrite(TSYLogLevelError, "Failed to move {} back to {}: {}", destination_.path(), url.path(),
+              moved.error());
   isUUIDWritten_ = false;
+  if (!old_ || old_->url() != destination_) return reenterReplacement(destination_);
   (void)TSYClientConnection::_moveItemAtURLToDeathRow(destination_, /*startDeletionThread=*/false);
+  if (!isReplacementDropped_) (void)TSYRemoveFromCache(*replacement_);
+}
+
+void TSYContainerExchange::reenterReplacement(const TSYURL& url) {
+  const bool isStill = !isReplacementDropped_ && url == replacement_->url();
+  if (isStill) return;
+  (void)TSYAddToCache(*replacement_, url, replacement_->transient(), /*updateSandbox=*/true);
 }
 
 bool TSYContainerExchange::putOldBack() {
   TSYLogWrite(TSYLogLevelDebug, "Recovering from failed replace by moving: {} to {}",
               staging_.path(), old_->url().path());
-  const auto moved = TSYFileManager::defaultManager().moveItemAtURL(staging_, old_->url());
+  const auto moved = TSYFileManager::defaultManager().renameItemAtURL(staging_, old_->url());
   if (moved) return true;
   (void)TSYErrorCreate(TSYErrorReplaceFileInvalid, moved.error(), TSYLogIt::yes,
                        "Failed to recover replace move: {} to {}", staging_.path(),

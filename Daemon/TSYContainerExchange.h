@@ -25,7 +25,8 @@ class TSYContainerExchange {
 
   // Codes 14, 15, 34, 45, 46, and those of the code-signing mapping. After a failure undo() is due.
   TSYResult<void> run();
-  // Returns whether the old container is where it was: if not, it is in staging.
+  // Returns whether all is on the disk as it was. If not, the journal of the replace is still
+  // needed: the old container may be in staging.
   bool undo();
 
  private:
@@ -33,7 +34,10 @@ class TSYContainerExchange {
   TSYResult<void> putReplacementInPlace();
   TSYResult<void> moveReplacement();
   void takeReplacementBack();
+  void reenterReplacement(const TSYURL& url);
+  bool restoreUUID();
   bool putOldBack();
+  static bool isOnDisk(const TSYURL& url);
 
   const TSYMetadataRef old_;
   const TSYMetadataRef replacement_;

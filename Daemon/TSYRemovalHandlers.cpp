@@ -79,11 +79,17 @@ uint64_t wipe(const TSYRelayEvent& event, TSYClientConnection& connection,
 
 // Without the UUID of an old container the new one becomes a regular container.
 uint64_t TSYHandleReplaceContainer(TSYRelayEvent& event, TSYClientConnection& connection) {
-  const auto replacement =
-      TSYResolveConcreteContainerIdentity(event.request, connection, kNewContainer);
   const auto old = TSYResolveNamedContainerIdentity(event.request, connection, kOldContainer);
   if (!old) return old.error();
-  if (!replacement) return replacement.error();
+  const auto named = TSYResolveNamedContainerIdentity(event.request, connection, kNewContainer);
+  if (!named) return named.error();
+  const auto* replacement = TSYConcreteContainerIdentity::orNull(**named);
+  if (replacement == nullptr) {
+    return TSYErrorCreate(TSYErrorInvalidObject, std::nullopt, TSYLogIt::yes,
+                          "Can't act on an invalid object: newUUID: {}, Class: {}", "(null)",
+                          (*named)->containerClass())
+        .code();
+  }
   return connection.replaceContainerIdentity(**old, *replacement, /*preserveOldUUID=*/false,
                                              /*startDeletionThread=*/false);
 }

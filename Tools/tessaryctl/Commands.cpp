@@ -38,7 +38,8 @@ std::optional<ContainerName> choose(Client& client, const Options& options, bool
   std::optional<ContainerName> chosen;
   for (const auto& container : *listed) {
     if (container.identifier != options.identifier) continue;
-    if (options.uuid && container.uuid.string() != *options.uuid) continue;
+    if (options.uuid && container.uuid != platform::UUID::parse(*options.uuid)) continue;
+    if (options.ownerPersona && container.personaUniqueString != *options.ownerPersona) continue;
     if (chosen) {
       complain("several containers have this identifier: choose one with --uuid");
       return std::nullopt;
@@ -81,6 +82,7 @@ int replace(Client& client, const Options& options) {
   if (!old) return kRefused;
   Options ofNew = options;
   ofNew.uuid.reset();
+  ofNew.ownerPersona = old->personaUniqueString;
   const auto replacement = choose(client, ofNew, /*transient=*/true);
   return replacement ? finish(client.replaceContainer(*old, *replacement)) : kRefused;
 }

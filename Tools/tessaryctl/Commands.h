@@ -18,6 +18,7 @@ struct Options {
   bool transient = false;
   // Which one, when several personas have a container of the identifier.
   std::optional<std::string> uuid;
+  std::optional<std::string> ownerPersona;
   std::string key;
   std::optional<std::string> json;  // an info value
 };

@@ -96,7 +96,7 @@ struct CommandLine {
                              command::stageForDelete));
     add("empty-death-row", "Wait until what was deleted is gone (command 4)",
         command::emptyDeathRow);
-    addTransient(addOfClass("delete", "Delete a container (command 10)", command::deleteContainer));
+    addOfClass("delete", "Delete a container (command 10)", command::deleteContainer);
     addNamed("wipe-plugin-data", "Empty a plug-in's data container (command 11)",
              command::wipePluginData);
     addOfClass("delete-content", "Empty a container under a user's home (command 12)",
