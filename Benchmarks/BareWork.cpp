@@ -52,5 +52,5 @@ void rename(const std::string& from, const std::string& to) {
 
 void syncDirectory(const std::string& path) {
   const FileDescriptor directory(::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-  check(::fsync(directory.get()) == 0, "cannot fsync");
+  check(directory.valid() && ::fsync(directory.get()) == 0, "cannot fsync");
 }

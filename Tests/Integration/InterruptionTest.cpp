@@ -222,7 +222,8 @@ class Interruption : public ::testing::TestWithParam<Operation> {
       ASSERT_TRUE(listed.has_value()) << listed.error().text;
       std::set<std::string> paths;
       for (const auto& container : *listed) {
-        const auto found = client_->metadata({container.identifier, 2, container.uuid, {}}, false);
+        const auto found = client_->metadata({container.identifier, 2, container.uuid, {}},
+                                             /*infoRequested=*/false);
         ASSERT_TRUE(found.has_value());
         paths.insert(std::filesystem::path(found->path).filename());
       }

@@ -14,8 +14,9 @@ namespace {
 // Reads before others get their turn.
 constexpr int kReadsPerTurn = 64;
 // How long a turn waits for more while other workers are free. A client that has its reply often
-// sends its next request at once, and a worker that waits for it on the socket itself is woken at a
-// third of the cost of one that epoll chooses. The kernel rounds it up to its clock's next tick.
+// sends its next request at once, and a worker that waits for it on the socket itself is woken
+// sooner than one that epoll chooses, mostly on another processor. The kernel rounds the time up to
+// its clock's next tick.
 constexpr timeval kLingering = {.tv_sec = 0, .tv_usec = 1'000};
 
 bool isOnlyNotNow(int error) {
