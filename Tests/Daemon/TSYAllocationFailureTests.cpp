@@ -18,6 +18,9 @@ thread_local int allocationsBeforeFailure = -1;
 
 }  // namespace
 
+// GCC does not see that this pair belongs together.
+#pragma GCC diagnostic ignored "-Wmismatched-new-delete"
+
 void* operator new(size_t size) {
   if (allocationsBeforeFailure >= 0 && allocationsBeforeFailure-- == 0) throw std::bad_alloc();
   if (void* memory = std::malloc(size)) return memory;
