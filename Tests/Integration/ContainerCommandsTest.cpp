@@ -400,7 +400,8 @@ TEST_F(ContainerCommands, ManyDeletionsLeaveNoTraceInTheProcess) {
       const std::string identifier = fmt::format("com.example.app{}", i);
       ASSERT_EQ(codeOf(Creation{2, identifier}.request(*client_)), kSuccess);
       ASSERT_EQ(codeOf(client_->deleteContainer(identifier, 2)), kSuccess);
-      if (i % 500 == 499) ASSERT_EQ(codeOf(client_->emptyDeathRow()), kSuccess);
+      if (i % 500 != 499) continue;
+      ASSERT_EQ(codeOf(client_->emptyDeathRow()), kSuccess);
     }
   };
   round(kRounds / 5);
@@ -409,7 +410,8 @@ TEST_F(ContainerCommands, ManyDeletionsLeaveNoTraceInTheProcess) {
   round(kRounds);
   EXPECT_LE(descriptors(), descriptorsBefore);
   // Allocators keep some; a leak of 100 bytes a deletion would be a megabyte.
-  if (kSanitizedStride == 1) EXPECT_LT(memory(), memoryBefore + 600) << "KiB";
+  if (kSanitizedStride > 1) return;
+  EXPECT_LT(memory(), memoryBefore + 600) << "KiB";
 }
 
 }  // namespace

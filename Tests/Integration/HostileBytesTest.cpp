@@ -43,7 +43,7 @@ Bytes framed(const std::string& body, uint32_t flags = 0, std::optional<uint32_t
   const auto header = platform::ipc::encodeHeader(
       {.bodyLength = length.value_or(body.size()), .sequence = 1, .flags = flags});
   Bytes bytes(header.begin(), header.end());
-  bytes.insert(bytes.end(), body.begin(), body.end());
+  std::ranges::copy(body, std::back_inserter(bytes));
   return bytes;
 }
 
