@@ -19,23 +19,21 @@ const std::string kDeathRow = kCaches + "/Dead";
 
 uint64_t emptyDeathRow() {
   std::promise<uint64_t> code;
-  TSYClientConnection::sharedClientConnection().deleteContainersOnDeathRowWithCompletion(
+  TSYClientConnection::deleteContainersOnDeathRowWithCompletion(
       [&](uint64_t result) { code.set_value(result); });
   return code.get_future().get();
 }
 
 TEST(TSYClientConnection, whatGoesToDeathRowKeepsItsNameAndIsEmptiedLater) {
   const ContainerDevice device;
-  TSYClientConnection& connection = TSYClientConnection::sharedClientConnection();
   device.write("/one/same/inside/file", "1");
   device.write("/two/same", "2");
   device.write("/victim/file", "3");
   std::filesystem::create_symlink(device.path("/victim"), device.path("/three"));
   for (const char* item : {"/one/same", "/two/same", "/three", "/missing"}) {
-    EXPECT_TRUE(
-        connection
-            ._moveItemAtURLToDeathRow(TSYURL(device.path(item)), /*startDeletionThread=*/false)
-            .has_value())
+    EXPECT_TRUE(TSYClientConnection::_moveItemAtURLToDeathRow(TSYURL(device.path(item)),
+                                                              /*startDeletionThread=*/false)
+                    .has_value())
         << item;
     EXPECT_FALSE(std::filesystem::exists(device.path(item)));
   }
@@ -49,8 +47,8 @@ TEST(TSYClientConnection, whatGoesToDeathRowKeepsItsNameAndIsEmptiedLater) {
   std::filesystem::remove_all(device.path(kCaches));
   device.write(kDeathRow, "in the way");
   EXPECT_EQ(emptyDeathRow(), 28U);
-  expectFailure(connection._moveItemAtURLToDeathRow(TSYURL(device.path("/victim")),
-                                                    /*startDeletionThread=*/false),
+  expectFailure(TSYClientConnection::_moveItemAtURLToDeathRow(TSYURL(device.path("/victim")),
+                                                              /*startDeletionThread=*/false),
                 41, "Failed to create unique directory at: " + device.path("/victim"));
 }
 
