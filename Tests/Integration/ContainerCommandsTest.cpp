@@ -208,6 +208,29 @@ TEST_F(ContainerCommands, ReplacingKeepsTheRules) {
   EXPECT_EQ(kRegular.lookUp(*client_)->uuid, alone.uuid);
 }
 
+TEST_F(ContainerCommands, OfTwoReplacesAtOnceOneWins) {
+  constexpr int kRounds = 30;
+  auto second = Client::connect(device_->root());
+  ASSERT_TRUE(second);
+  Container old = create(kRegular);
+  for (int round = 0; round < kRounds; ++round) {
+    const Container replacement = create(kTransient);
+    const ContainerName from = nameOf(old, 2);
+    const ContainerName to = nameOf(replacement, 2);
+    uint64_t codeOfSecond = 0;
+    std::jthread other([&] { codeOfSecond = codeOf(second->replaceContainer(from, to)); });
+    const uint64_t codeOfFirst = codeOf(client_->replaceContainer(from, to));
+    other.join();
+    EXPECT_EQ(std::min(codeOfFirst, codeOfSecond), kSuccess);
+    EXPECT_EQ(std::max(codeOfFirst, codeOfSecond), 21U);
+    auto found = kRegular.lookUp(*client_);
+    ASSERT_TRUE(found);
+    EXPECT_EQ(found->uuid, replacement.uuid);
+    old = std::move(*found);
+  }
+  EXPECT_EQ(itemsIn(*device_, kRegular.classDirectory()).size(), 1U);
+}
+
 TEST_F(ContainerCommands, AWipedContainerKeepsItsNameAndUUID) {
   const Creation plugin{4, "com.example.plugin"};
   const Container before = create(plugin);
