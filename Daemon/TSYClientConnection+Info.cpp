@@ -42,10 +42,6 @@ bool keepsItsDirectoryName(const TSYMetadata& container) {
                             container.identifier(), container.containerClass());
 }
 
-bool isMeasuredOnce(TSYContainerClass containerClass) {
-  return TSYIsBundleClass(containerClass);
-}
-
 }  // namespace
 
 TSYResult<void> TSYClientConnection::setInfoValue(const std::optional<Value>& value,
@@ -176,7 +172,7 @@ TSYResult<uint64_t> TSYClientConnection::diskUsage(const TSYConcreteContainerIde
     auto found = TSYFindContainer(identity);
     if (!found) return TSYFailure(std::move(found.error()));
     container = std::move(*found);
-    if (isMeasuredOnce(container->containerClass())) {
+    if (TSYIsBundleClass(container->containerClass())) {
       const auto known = infoValueForKey(kStaticDiskUsageKey, identity, /*useLocking=*/false);
       if (known && known->asUInt64()) return *known->asUInt64();
       if (!known && !known.error().is(TSYErrorInfoValueNotFound)) {
@@ -186,7 +182,7 @@ TSYResult<uint64_t> TSYClientConnection::diskUsage(const TSYConcreteContainerIde
     }
   }
   const uint64_t size = TSYFileManager::defaultManager().fastDiskUsageForURL(container->url());
-  if (!isFast && isMeasuredOnce(container->containerClass())) {
+  if (!isFast && TSYIsBundleClass(container->containerClass())) {
     const auto set = setInfoValue(Value(size), kStaticDiskUsageKey, identity, /*useLocking=*/true);
     if (!set) {
       TSYLogWrite(TSYLogLevelError, "Error setting info value for identity: {}: {}",

@@ -79,11 +79,13 @@ TSYResult<TSYURL> freeDestination(const TSYMetadata* old, const TSYMetadata& rep
                                    "Container already exists at {}", destination.path()));
 }
 
-// A container that becomes a regular one must be the only one of its name.
+// A container that becomes a regular one, or takes another name's place, must be the only one of
+// its name.
 TSYResult<void> checkNoOtherRegular(const TSYConcreteContainerIdentity& identity) {
   const auto found = TSYContainerCache::sharedInstance().containerForContainerIdentity(
       static_cast<const TSYContainerIdentity&>(identity), /*transient=*/false,
       /*updateSandbox=*/true);
+  if (found && (*found)->uuid() == identity.uuid()) return {};
   if (found) {
     return TSYFailure(
         TSYErrorCreate(TSYErrorAlreadyExists, std::nullopt, TSYLogIt::yes,
@@ -316,10 +318,12 @@ TSYResult<void> TSYClientConnection::recoverFromReplaceOperation(const TSYURL& j
 
 TSYResult<void> TSYClientConnection::repairReplace(const ReplaceURLs& urls) {
   TSYFileManager& files = TSYFileManager::defaultManager();
-  const bool isOldAside = files.itemDoesNotExistAtURL(urls.old) &&
-                          files.itemDoesNotExistAtURL(urls.destination) &&
+  // What cannot be told is a reason to try: the rename fails where anything but an empty directory
+  // stands, and a failure leaves the journal for the next start.
+  const bool mayBeAside = !files.itemExistsAtURL(urls.old) &&
+                          !files.itemExistsAtURL(urls.destination) &&
                           !files.itemDoesNotExistAtURL(urls.staging);
-  if (isOldAside) {
+  if (mayBeAside) {
     TSYLogWrite(TSYLogLevelDebug, "Recovering from failed replace by moving: {} to {}",
                 urls.staging.path(), urls.old.path());
     auto moved = files.renameItemAtURL(urls.staging, urls.old);

@@ -294,12 +294,12 @@ INSTANTIATE_TEST_SUITE_P(At, AttackInPlace, ::testing::ValuesIn(kPlaces),
 
 TEST_F(Attack, ALayoutPathThroughALinkIsNoHome) {
   device_->stop();
-  device_->setPersonas({{"W", 101, "enterprise", std::string(kHome) + "/work/home", {}},
+  device_->setPersonas({{"W", 101, "enterprise", std::string(kHome) + "/office/home", {}},
                         {"P", 100, "personal", {}, {}}});
   Caller worker = privilegedCaller();
   worker.persona = "W";
-  fs::create_directory(home("work"));
-  fs::create_symlink(otherHome(), home("work/home"));
+  fs::create_directory(home("office"));
+  fs::create_symlink(otherHome(), home("office/home"));
   device_->start();
   const Watchdog watchdog(*device_);
   tessary::Client client = device_->connect(worker);

@@ -31,14 +31,14 @@ enum Code : uint64_t {
 };
 
 constexpr char kHome[] = "/private/var/mobile/";
-constexpr char kWork[] = "/private/var/work/";
+constexpr char kWork[] = "/private/var/office/";
 constexpr char kSecond[] = "/private/var/second/";
 constexpr int kWorkID = 101;
 constexpr uint32_t kDataItem = 1;  // the sandbox's number for data containers
 
 const Device::Persona kPersonal{"P", 100, "personal", "", {}};
 const Device::Persona kEnterprise{
-    "W", kWorkID, "enterprise", "/private/var/work", {"com.example.work", "com.example.both"}};
+    "W", kWorkID, "enterprise", "/private/var/office", {"com.example.work", "com.example.both"}};
 const Device::Persona kOtherEnterprise{
     "S", 102, "enterprise", "/private/var/second", {"com.example.second", "com.example.both"}};
 const Device::Persona kUniversal{"U", 103, "universal", "", {"com.example.mail"}};

@@ -313,7 +313,7 @@ TEST_F(Rights, OneInstallerDoesNotLendItsRightsToAnother) {
 TEST_F(Rights, TokensOpenEnterpriseContainersToSandboxedProcesses) {
   device_->stop();
   device_->setPersonas({{"P", 100, "personal", "", {}},
-                        {"W", 101, "enterprise", "/private/var/work", {"com.example.mixed"}}});
+                        {"W", 101, "enterprise", "/private/var/office", {"com.example.mixed"}}});
   device_->start();
   const auto process =
       platform::AuditToken::make(0, 0, ::getpid(), *platform::processStartTime(::getpid()));
