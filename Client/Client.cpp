@@ -1,6 +1,6 @@
 #include "Client/Client.h"
 
-#include <fmt/format.h>
+#include "Client/Wire.h"
 
 using platform::UUID;
 using platform::Value;
@@ -12,50 +12,6 @@ namespace {
 
 constexpr char kSocket[] = "/run/tessary/com.veltra.tessaryd";
 constexpr uint64_t kSuccess = 1;
-
-enum Command : uint64_t {
-  kCreateOrLookup = 0,
-  kContainersOfClass = 1,
-  kReplaceContainer = 2,
-  kStageForDelete = 3,
-  kEmptyDeathRow = 4,
-  kSetInfoValue = 5,
-  kGetInfoValue = 6,
-  kGetMetadata = 7,
-  kRecreateStructure = 8,
-  kRegenerateUUID = 9,
-  kDeleteContainer = 10,
-  kWipePluginData = 11,
-  kDeleteDataContent = 12,
-  kSystemContainerPath = 15,
-  kDiskUsage = 23,
-  kRetired = 27,
-  kPersonaList = 32,
-};
-
-std::unexpected<Error> missing(std::string_view key) {
-  return std::unexpected(Error{.kind = Error::Kind::protocol,
-                               .code = 0,
-                               .text = fmt::format("the reply has no valid \"{}\"", key)});
-}
-
-std::optional<std::string> optionalString(const Message& reply, std::string_view key) {
-  const std::string* value = reply.string(key);
-  return value == nullptr ? std::nullopt : std::optional(*value);
-}
-
-// The strings of an array; none when there is no array or something else is in it.
-std::optional<std::vector<std::string>> strings(const Message& reply, std::string_view key) {
-  const Value::Array* array = reply.array(key);
-  if (array == nullptr) return std::nullopt;
-  std::vector<std::string> list;
-  list.reserve(array->size());
-  for (const Value& element : *array) {
-    if (element.asString() == nullptr) return std::nullopt;
-    list.push_back(*element.asString());
-  }
-  return list;
-}
 
 Message requestFor(const ContainerName& container) {
   Message request;
@@ -110,6 +66,23 @@ Result<void> Client::callForNothing(uint64_t command, Message request) {
   const auto reply = call(command, std::move(request));
   if (!reply) return std::unexpected(reply.error());
   return {};
+}
+
+Result<std::string> Client::callForPath(uint64_t command, Message request) {
+  const auto reply = call(command, std::move(request));
+  if (!reply) return std::unexpected(reply.error());
+  const std::string* path = reply->string("ReplyPath");
+  if (path == nullptr) return missing("ReplyPath");
+  return *path;
+}
+
+Result<std::vector<std::string>> Client::callForStrings(uint64_t command, Message request,
+                                                        std::string_view key) {
+  const auto reply = call(command, std::move(request));
+  if (!reply) return std::unexpected(reply.error());
+  auto list = strings(*reply, key);
+  if (!list) return missing(key);
+  return *std::move(list);
 }
 
 Result<Container> Client::createOrLookup(const std::optional<std::string>& identifier,
@@ -281,11 +254,7 @@ Result<uint64_t> Client::diskUsage(const ContainerName& container) {
 Result<std::string> Client::systemContainerPath(const std::optional<std::string>& identifier) {
   Message request;
   if (identifier) request.set("Identifier", *identifier);
-  const auto reply = call(kSystemContainerPath, std::move(request));
-  if (!reply) return std::unexpected(reply.error());
-  const std::string* path = reply->string("ReplyPath");
-  if (path == nullptr) return missing("ReplyPath");
-  return *path;
+  return callForPath(kSystemContainerPath, std::move(request));
 }
 
 Result<void> Client::retired() {
@@ -293,11 +262,7 @@ Result<void> Client::retired() {
 }
 
 Result<std::vector<std::string>> Client::personaList() {
-  const auto reply = call(kPersonaList, Message());
-  if (!reply) return std::unexpected(reply.error());
-  auto personas = strings(*reply, "ReplyPersonaUniqueStringsArray");
-  if (!personas) return missing("ReplyPersonaUniqueStringsArray");
-  return std::move(*personas);
+  return callForStrings(kPersonaList, Message(), "ReplyPersonaUniqueStringsArray");
 }
 
 }  // namespace tessary

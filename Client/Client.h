@@ -10,6 +10,7 @@
 #include <expected>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include "Platform/ipc/Channel.h"
@@ -73,10 +74,45 @@ struct CreateOrLookupOptions {
   bool transient = false;
 };
 
+// A container that is shared by the members of a group.
+struct GroupContainer {
+  std::string identifier;  // the group's
+  std::string path;
+  // These two only for a sandboxed caller, as in Container.
+  std::optional<std::string> personaUniqueString;
+  std::optional<std::string> sandboxToken;
+};
+
+struct RegistrationOptions {
+  // Of the data container that belongs to the identifier; 0 for none.
+  ContainerClass dataContainerClass = 0;
+  // The identifier is a plug-in of this application, which must be registered already.
+  std::optional<std::string> parentIdentifier;
+  // What is not installed yet: it counts as a member of its groups, and codeSigningInfo() does not
+  // answer it. An advance copy is forgotten when the device starts again.
+  bool placeholder = false;
+  bool advanceCopy = false;
+  // A later registration by the identifier's own process may change it.
+  bool registeredByCaller = false;
+};
+
+struct UserManagedAssetsOptions {
+  bool isRelative = false;  // to the container's directory
+  bool createIfNecessary = false;
+};
+
+struct UserManagedAssets {
+  std::string path;
+  bool existed = false;  // found, not made by this call
+};
+
 // The short name of a daemon's code, such as "TSYErrorNotFound"; empty for an unknown one.
 std::string_view errorName(uint64_t code);
 // What the code means, in a few words; empty for an unknown one.
 std::string_view errorMessage(uint64_t code);
+
+// Where code-signing information holds the entitlements.
+inline constexpr char kEntitlementsKey[] = "com.veltra.Tessary.Entitlements";
 
 class Client {
  public:
@@ -118,6 +154,48 @@ class Client {
   // The path of a system container (class 12), which is made when it is not there. Without an
   // identifier: the caller's own.
   Result<std::string> systemContainerPath(const std::optional<std::string>& identifier);
+
+  // The groups below are those in the entitlements that are registered for the owner; without one
+  // the caller is the owner. Another owner than the caller takes a right to look it up.
+
+  // The containers of the owner's application groups (class 7), and of his system groups (class
+  // 13). Those that are not there are made.
+  Result<std::vector<GroupContainer>> groupContainers(
+      const std::optional<std::string>& owner = std::nullopt);
+  Result<std::vector<GroupContainer>> systemGroupContainers(
+      const std::optional<std::string>& owner = std::nullopt);
+  // The owner's application groups; makes nothing. Takes an entitlement, for one's own too.
+  Result<std::vector<std::string>> groupIdentifiers(
+      const std::optional<std::string>& owner = std::nullopt);
+  // The container of one system group, which is made when it is not there. The group must be one of
+  // the caller's own and of the owner's, or a well-known one.
+  Result<std::string> systemGroupContainerPath(const std::optional<std::string>& owner,
+                                               const std::string& group);
+
+  // The next three are for those who install.
+
+  // What an identifier is entitled to, in place of what was registered before; its entitlements
+  // stand under kEntitlementsKey. Without information the identifier is forgotten. An application
+  // group that nobody names any more and a system container that is given up lose their content.
+  Result<void> registerCodeSigningInfo(const std::string& identifier,
+                                       const std::optional<platform::Value::Dictionary>& info,
+                                       const RegistrationOptions& options = {});
+  Result<platform::Value::Dictionary> codeSigningInfo(const std::string& identifier);
+  // The entries of applications without a bundle container: codeSigningInfo() answers them no more.
+  Result<void> invalidateCodeSigningInfo();
+
+  // Moves an item within the container of a system group of the caller's own; the paths are
+  // relative to the container. Returns where the item is now. Takes an entitlement of its own.
+  Result<std::string> stageSharedContent(const std::string& group, const std::string& source,
+                                         const std::string& destination);
+  // Where an application keeps, in its data container, what its user manages. The caller's own, or
+  // anyone's with the entitlement for it.
+  Result<UserManagedAssets> userManagedAssetsPath(const std::string& identifier,
+                                                  const UserManagedAssetsOptions& options = {});
+  // Deletes one item in there. Takes the entitlement, for one's own too.
+  Result<void> deleteUserManagedAsset(const std::string& identifier,
+                                      const std::string& relativePath);
+
   // A command that there was once: always fails with 49.
   Result<void> retired();
   // The unique strings of the personas that the caller may see.
@@ -129,6 +207,12 @@ class Client {
  private:
   // A command whose reply carries nothing.
   Result<void> callForNothing(uint64_t command, platform::ipc::Message request);
+  // Commands that reply one path, strings under `key`, or the containers of groups.
+  Result<std::string> callForPath(uint64_t command, platform::ipc::Message request);
+  Result<std::vector<std::string>> callForStrings(uint64_t command, platform::ipc::Message request,
+                                                  std::string_view key);
+  Result<std::vector<GroupContainer>> callForGroups(uint64_t command,
+                                                    const std::optional<std::string>& owner);
 
   explicit Client(platform::ipc::Channel channel) : channel_(std::move(channel)) {}
 

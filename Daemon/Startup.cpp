@@ -1,10 +1,10 @@
 #include "Daemon/Startup.h"
 
-#include <cstdlib>
-
 #include "Daemon/TSYClientConnection.h"
+#include "Daemon/TSYCodeSigningMapping.h"
 #include "Daemon/TSYDaemonQueues.h"
 #include "Daemon/TSYGlobalConfiguration.h"
+#include "Daemon/TSYInvariant.h"
 #include "Daemon/TSYLockStateFollower.h"
 #include "Daemon/TSYLog.h"
 #include "Platform/os/Platform.h"
@@ -24,12 +24,6 @@ constexpr TSYLogRotation kInternalLogRotation{.files = 4, .bytesPerFile = 262'14
 // The id of the interval "StartingUp".
 const char kStartingUp = 0;
 
-// What cannot be done without ends the process; the service manager sees it fail.
-[[noreturn]] void stopProcess(std::string_view reason) {
-  TSYSystemLogWriteText(TSYChannel::startup, LogLevel::fault, "Startup", reason);
-  std::_Exit(EXIT_FAILURE);
-}
-
 void openLog() {
   TSYGlobalConfiguration& configuration = TSYGlobalConfiguration::sharedInstance();
   const std::string path = configuration.logDirectory().appending("tessaryd.log").path();
@@ -48,7 +42,7 @@ void createSharedQueues() {
     TSYDeathRowQueue().async([] {});
     TSYLockStateQueue().async([] {});
   } catch (const std::exception&) {
-    stopProcess("Can't create dispatch queues.");
+    TSYStopProcess(TSYChannel::startup, "Can't create dispatch queues.");
   }
 }
 
@@ -121,6 +115,8 @@ void TSYInitialiseDaemon() {
   openLog();
   logMissingRights();
   createSharedQueues();
+  // A database that cannot be opened ends the start here.
+  (void)TSYCodeSigningMapping::sharedInstance();
   TSYClientConnection& connection = TSYClientConnection::sharedClientConnection();
   const bool isFirstBoot = !Platform::current().semaphores.exists(kFirstBootMarker);
   if (isFirstBoot) {

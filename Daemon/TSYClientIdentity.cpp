@@ -99,6 +99,11 @@ TSYResult<std::string> TSYClientIdentity::_bundleIdentifierFromPeer(
     return TSYFailure(
         TSYPosixErrorCreate(platform::Errno{EINVAL}, "its record has no code-signing identifier"));
   }
+  // The code-signing database would take it for the identifier before the NUL.
+  if (peer.task->signingIdentifier->contains('\0')) {
+    return TSYFailure(
+        TSYPosixErrorCreate(platform::Errno{EINVAL}, "its code-signing identifier holds a NUL"));
+  }
   return *peer.task->signingIdentifier;
 }
 

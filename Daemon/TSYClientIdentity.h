@@ -31,7 +31,7 @@ class TSYClientIdentity {
   // while the caller context of the request is set.
   static TSYClientIdentityRef clientIdentityWithRelayConnection(const platform::ipc::Peer& peer);
   // The code-signing identifier of the process; a POSIX error when it has no record (ENOENT) or one
-  // without an identifier (EINVAL).
+  // without an identifier, or with a NUL in it (EINVAL).
   static TSYResult<std::string> _bundleIdentifierFromPeer(const platform::ipc::Peer& peer);
   // For the daemon's own work on behalf of a user.
   static TSYClientIdentityRef privilegedClientIdentityWithUserIdentity(

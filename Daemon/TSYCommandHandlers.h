@@ -28,6 +28,23 @@ uint64_t TSYHandleRecreateStructure(TSYRelayEvent& event, TSYClientConnection& c
 uint64_t TSYHandleRegenerateUUID(TSYRelayEvent& event, TSYClientConnection& connection);
 uint64_t TSYHandleDiskUsage(TSYRelayEvent& event, TSYClientConnection& connection);
 
+// TSYGroupHandlers.cpp
+uint64_t TSYHandleGroupContainersForOwner(TSYRelayEvent& event, TSYClientConnection& connection);
+uint64_t TSYHandleGroupIdentifiersForOwner(TSYRelayEvent& event, TSYClientConnection& connection);
+uint64_t TSYHandleSystemGroupContainersForOwner(TSYRelayEvent& event,
+                                                TSYClientConnection& connection);
+uint64_t TSYHandleSystemGroupContainerPath(TSYRelayEvent& event, TSYClientConnection& connection);
+
+// TSYCodeSigningHandlers.cpp
+uint64_t TSYHandleRegisterCodeSigningInfo(TSYRelayEvent& event, TSYClientConnection& connection);
+uint64_t TSYHandleGetCodeSigningInfo(TSYRelayEvent& event, TSYClientConnection& connection);
+uint64_t TSYHandleInvalidateCodeSigningInfo(TSYRelayEvent& event, TSYClientConnection& connection);
+
+// TSYSharedContentHandlers.cpp
+uint64_t TSYHandleStageSharedContent(TSYRelayEvent& event, TSYClientConnection& connection);
+uint64_t TSYHandleUserManagedAssetsPath(TSYRelayEvent& event, TSYClientConnection& connection);
+uint64_t TSYHandleDeleteUserManagedAsset(TSYRelayEvent& event, TSYClientConnection& connection);
+
 // A command that there was once.
 uint64_t TSYHandleRetired(TSYRelayEvent& event, TSYClientConnection& connection);
 // A command whose operation is not built yet.

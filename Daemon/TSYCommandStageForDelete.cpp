@@ -60,16 +60,19 @@ TSYResult<void> stage(const TSYMetadata& container, TSYCommandQueue& queue) {
 }  // namespace
 
 TSYCommandStageForDelete::TSYCommandStageForDelete(
-    std::vector<TSYContainerIdentityRef> containerIdentities, bool useLocking, OnError onError)
+    std::vector<TSYContainerIdentityRef> containerIdentities, bool useLocking, OnError onError,
+    Condition isStillWanted)
     : containerIdentities_(std::move(containerIdentities)),
       useLocking_(useLocking),
-      onError_(std::move(onError)) {}
+      onError_(std::move(onError)),
+      isStillWanted_(std::move(isStillWanted)) {}
 
 std::shared_ptr<TSYCommandStageForDelete>
 TSYCommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
-    std::vector<TSYContainerIdentityRef> containerIdentities, bool useLocking, OnError onError) {
+    std::vector<TSYContainerIdentityRef> containerIdentities, bool useLocking, OnError onError,
+    Condition isStillWanted) {
   return std::make_shared<TSYCommandStageForDelete>(std::move(containerIdentities), useLocking,
-                                                    std::move(onError));
+                                                    std::move(onError), std::move(isStillWanted));
 }
 
 TSYResult<void> TSYCommandStageForDelete::fromQueueExecute(TSYCommandQueue& queue) {
@@ -80,6 +83,7 @@ TSYResult<void> TSYCommandStageForDelete::fromQueueExecute(TSYCommandQueue& queu
 
 TSYResult<void> TSYCommandStageForDelete::stageAll(TSYCommandQueue& queue) const {
   const TSYAllIdentifiersLock lock(TSYLockMode::writing, useLocking_);
+  if (isStillWanted_ && !isStillWanted_()) return {};
   for (const TSYContainerIdentityRef& identity : containerIdentities_) {
     const TSYMetadataRef container = find(*identity);
     if (!container) continue;

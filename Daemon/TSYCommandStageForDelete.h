@@ -13,15 +13,18 @@
 class TSYCommandStageForDelete : public TSYCommand {
  public:
   using OnError = std::function<void(uint64_t code)>;
+  using Condition = std::function<bool()>;
 
   // A concrete identity means that very container, a plain one the regular container of its name;
   // one that is not there is passed over. With useLocking false whoever makes the command holds the
   // all-identifiers write lock when it runs. `onError`, which may be null, is told the code of a
-  // command that fails: 46, 40.
+  // command that fails: 46, 40. `isStillWanted`, which may be null, is asked under the lock: what
+  // was true when the command was made need not be when it runs.
   TSYCommandStageForDelete(std::vector<TSYContainerIdentityRef> containerIdentities,
-                           bool useLocking, OnError onError);
+                           bool useLocking, OnError onError, Condition isStillWanted = nullptr);
   static std::shared_ptr<TSYCommandStageForDelete> commandForStageForDeleteWithContainerIdentities(
-      std::vector<TSYContainerIdentityRef> containerIdentities, bool useLocking, OnError onError);
+      std::vector<TSYContainerIdentityRef> containerIdentities, bool useLocking, OnError onError,
+      Condition isStillWanted = nullptr);
 
   const std::vector<TSYContainerIdentityRef>& containerIdentities() const {
     return containerIdentities_;
@@ -38,4 +41,5 @@ class TSYCommandStageForDelete : public TSYCommand {
   const std::vector<TSYContainerIdentityRef> containerIdentities_;
   const bool useLocking_;
   const OnError onError_;
+  const Condition isStillWanted_;
 };

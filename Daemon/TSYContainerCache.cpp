@@ -8,6 +8,7 @@
 #include "Daemon/TSYException.h"
 #include "Daemon/TSYFileManager.h"
 #include "Daemon/TSYGlobalConfiguration.h"
+#include "Daemon/TSYInvariant.h"
 #include "Daemon/TSYLog.h"
 #include "Daemon/TSYWhitelist.h"
 #include "Platform/os/Platform.h"
@@ -203,6 +204,7 @@ TSYResult<TSYMetadataRef> TSYContainerCache::containerForContainerIdentity(
 
 TSYResult<TSYMetadataRef> TSYContainerCache::lookUp(const TSYContainerIdentity& identity,
                                                     bool transient, bool updateSandbox) {
+  TSY_INVARIANT(!codeSigningMapping_.isOnQueue());
   TSYMetadataRef container;
   {
     const MutexLock lock(cacheLock_);

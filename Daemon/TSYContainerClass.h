@@ -8,7 +8,9 @@ using TSYContainerClass = uint64_t;
 
 inline constexpr TSYContainerClass kTSYContainerClassAppBundle = 1;
 inline constexpr TSYContainerClass kTSYContainerClassAppData = 2;
+inline constexpr TSYContainerClass kTSYContainerClassPluginBundle = 3;
 inline constexpr TSYContainerClass kTSYContainerClassPluginData = 4;
+inline constexpr TSYContainerClass kTSYContainerClassVPNPluginBundle = 5;
 inline constexpr TSYContainerClass kTSYContainerClassVPNPluginData = 6;
 inline constexpr TSYContainerClass kTSYContainerClassAppGroup = 7;
 inline constexpr TSYContainerClass kTSYContainerClassInternalDaemon = 10;

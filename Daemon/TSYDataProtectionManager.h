@@ -1,7 +1,6 @@
 // The protection classes of data containers.
 //
-// Changing a class is not built yet, and the class that an application's entitlements ask for needs
-// the code-signing database: until it is there nobody asks for any, and the answer is 0.
+// Changing a class is not built yet.
 //
 // All operations may be called from any thread.
 #pragma once

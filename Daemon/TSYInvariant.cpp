@@ -2,7 +2,10 @@
 
 #include <cstdlib>
 
-#include "Daemon/TSYLog.h"
+void TSYStopProcess(TSYChannel channel, std::string_view reason) {
+  TSYSystemLogWriteText(channel, platform::LogLevel::fault, "TSYStopProcess", reason);
+  std::_Exit(EXIT_FAILURE);
+}
 
 void TSYInvariantBroken(std::string_view invariant, std::source_location where) {
   const std::string text = fmt::format("Assertion failed at line {}: {}", where.line(), invariant);

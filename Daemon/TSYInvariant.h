@@ -1,8 +1,14 @@
-// Invariants that well-paired calls cannot break. A broken one stops the process, naming itself.
+// The ends of the process: a broken invariant, which well-paired calls cannot break, and the lack
+// of what the daemon cannot do without.
 #pragma once
 
 #include <source_location>
 #include <string_view>
+
+#include "Daemon/TSYLog.h"
+
+// Ends the process with a fault in the system log; the service manager sees it fail.
+[[noreturn]] void TSYStopProcess(TSYChannel channel, std::string_view reason);
 
 [[noreturn]] void TSYInvariantBroken(std::string_view invariant, std::source_location where);
 

@@ -30,15 +30,30 @@ std::string descriptionOf(const TSYUserIdentityCache::IdentitySet& identities) {
   return text + ")}";
 }
 
-// The bundle whose personas decide: plug-ins follow the application that they belong to.
-std::string bundleIdentifierFor(const std::string& identifier, TSYContainerClass containerClass) {
-  if (containerClass != kTSYContainerClassPluginData &&
-      containerClass != kTSYContainerClassVPNPluginData) {
-    return identifier;
-  }
+// The application that a plug-in belongs to, or the bundle itself.
+std::string applicationOf(const std::string& identifier) {
   return TSYCodeSigningMapping::sharedInstance()
       .parentIdentifierForChildIdentifier(identifier)
       .value_or(identifier);
+}
+
+// The bundle whose personas decide: plug-ins follow the application that they belong to.
+std::string bundleIdentifierFor(const std::string& identifier, TSYContainerClass containerClass) {
+  const bool isPluginData = containerClass == kTSYContainerClassPluginData ||
+                            containerClass == kTSYContainerClassVPNPluginData;
+  return isPluginData ? applicationOf(identifier) : identifier;
+}
+
+TSYUserIdentityCache::IdentitySet ownersOf(const std::string& bundleIdentifier) {
+  return TSYContainerCache::sharedInstance().userIdentityCache().userIdentitiesForBundleIdentifier(
+      bundleIdentifier);
+}
+
+void logAmbiguity(const std::string& bundleIdentifier,
+                  const TSYUserIdentityCache::IdentitySet& identities, const TSYUserIdentity& own) {
+  TSYSystemLogWrite(TSYChannel::unspecified, LogLevel::fault,
+                    "Ambiguous user identity from [{}]. Expected one of [{}], got {}",
+                    bundleIdentifier, descriptionOf(identities), own.shortDescription());
 }
 
 // The class under a key. Code 20 (logged) outside 1 to 13.
@@ -107,9 +122,7 @@ TSYResolved<TSYUserIdentityRef> TSYResolveUserIdentityForIdentifier(
   if (!TSYIsPerUserClass(containerClass) || !own->isNoSpecificPersona()) return own;
 
   const std::string bundleIdentifier = bundleIdentifierFor(identifier, containerClass);
-  const auto identities =
-      TSYContainerCache::sharedInstance().userIdentityCache().userIdentitiesForBundleIdentifier(
-          bundleIdentifier);
+  const auto identities = ownersOf(bundleIdentifier);
   if (TSYLogIsEnabled(TSYLogLevelDebug)) {
     TSYLogWrite(TSYLogLevelDebug,
                 "Chose bundleIdentifier: {}, userIdentities: {} for identifier: {}, class: {}",
@@ -120,11 +133,34 @@ TSYResolved<TSYUserIdentityRef> TSYResolveUserIdentityForIdentifier(
     TSYLogWrite(TSYLogLevelError, "{} trying to look up persona for {}:{}",
                 connection.clientBundleIdentifier(), containerClass, identifier);
   } else if (!identities.contains(own)) {
-    TSYSystemLogWrite(TSYChannel::unspecified, LogLevel::fault,
-                      "Ambiguous user identity from [{}]. Expected one of [{}], got {}",
-                      bundleIdentifier, descriptionOf(identities), own->shortDescription());
+    logAmbiguity(bundleIdentifier, identities, *own);
   }
   return own;
+}
+
+TSYResolved<TSYUserIdentityRef> TSYResolveUserIdentityForGroupOwner(
+    const TSYClientConnection& connection, const std::string& owner) {
+  TSYUserIdentityRef own = connection.clientUserIdentity();
+  if (!own) return std::unexpected(uint64_t{TSYErrorPersonaMismatch});
+  if (!own->isNoSpecificPersona()) return own;
+
+  const std::string bundleIdentifier = applicationOf(owner);
+  const auto identities = ownersOf(bundleIdentifier);
+  if (TSYLogIsEnabled(TSYLogLevelDebug)) {
+    TSYLogWrite(TSYLogLevelDebug,
+                "Chose bundleIdentifier: {} for group container lookup, userIdentities: {} for "
+                "identifier: {}",
+                bundleIdentifier, descriptionOf(identities), owner);
+  }
+  if (identities.size() == 1) return *identities.begin();
+  if (identities.contains(own)) return own;
+  if (identities.empty()) {
+    TSYLogWrite(TSYLogLevelError, "{} trying to look up persona for group owner {}",
+                connection.clientBundleIdentifier(), owner);
+  } else {
+    logAmbiguity(bundleIdentifier, identities, *own);
+  }
+  return std::unexpected(uint64_t{TSYErrorPersonaMismatch});
 }
 
 TSYResolved<TSYContainerIdentity> TSYResolveContainerIdentity(const Message& request,

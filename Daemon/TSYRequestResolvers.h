@@ -35,6 +35,11 @@ TSYResolved<TSYUserIdentityRef> TSYResolveUserIdentityForIdentifier(
     const TSYClientConnection& connection, const std::string& identifier,
     TSYContainerClass containerClass);
 
+// Whose groups of an owner are meant: as above, for the application that the owner belongs to. But
+// code 76 too when several personas, or none, may own them: a guess would hand out another's data.
+TSYResolved<TSYUserIdentityRef> TSYResolveUserIdentityForGroupOwner(
+    const TSYClientConnection& connection, const std::string& owner);
+
 // Codes 18, 20, 76, and those of TSYContainerIdentity.
 TSYResolved<TSYContainerIdentity> TSYResolveContainerIdentity(const platform::ipc::Message& request,
                                                               const TSYClientConnection& connection,

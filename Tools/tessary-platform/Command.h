@@ -7,13 +7,11 @@
 #include <sys/types.h>
 
 #include <CLI/CLI.hpp>
-#include <expected>
 #include <functional>
 #include <memory>
 #include <string>
 
 #include "Platform/fs/FileSystem.h"
-#include "Platform/values/Value.h"
 
 struct Application {
   CLI::App cli{"Prepares and drives what stands in for the operating system under a root."};
@@ -42,6 +40,3 @@ int complain(int status, const std::string& text);
 std::unique_ptr<platform::FileSystem> openRoot(const Application& application);
 // The same for a command that writes under run/tessary, which is prepared.
 std::unique_ptr<platform::FileSystem> openPreparedRoot(const Application& application);
-
-// The property list in a file of the caller's, anywhere; else what is wrong with it.
-std::expected<platform::Value, std::string> readPropertyListFile(const std::string& path);

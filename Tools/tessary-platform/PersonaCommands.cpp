@@ -8,6 +8,7 @@
 #include "Platform/os/PersonaList.h"
 #include "Platform/os/RuntimeDirectory.h"
 #include "Platform/values/PropertyList.h"
+#include "Tools/PropertyListFile.h"
 #include "Tools/tessary-platform/Command.h"
 
 namespace {

@@ -9,6 +9,7 @@
 
 #include "Platform/os/Accounts.h"
 #include "Platform/os/Tasks.h"
+#include "Tools/PropertyListFile.h"
 #include "Tools/tessary-platform/Command.h"
 
 namespace {
@@ -29,16 +30,12 @@ struct RunOptions {
 
 // The dictionary in a file of the caller's; none, with a complaint, when there is none in it.
 std::shared_ptr<const platform::Value::Dictionary> readEntitlements(const std::string& path) {
-  const auto reject = [&](const std::string& reason) {
-    complain(kBadUsage, fmt::format("--entitlements {}: {}", path, reason));
+  auto entitlements = readDictionaryFile(path);
+  if (!entitlements) {
+    complain(kBadUsage, fmt::format("--entitlements {}: {}", path, entitlements.error()));
     return nullptr;
-  };
-  auto value = readPropertyListFile(path);
-  if (!value) return reject(value.error());
-  if (value->asDictionary() == nullptr) {
-    return reject(fmt::format("no dictionary: {}", value->typeName()));
   }
-  return std::make_shared<const platform::Value::Dictionary>(std::move(*value->asDictionary()));
+  return std::make_shared<const platform::Value::Dictionary>(*std::move(entitlements));
 }
 
 // Who the program is to run as: mobile, unless the options say otherwise.

@@ -1,12 +1,9 @@
 // tessary-platform: the other side of the platform stand-ins. What a device's own services would do
 // (start applications, lock the device, change personas), this tool does by writing their files.
-#include <fcntl.h>
 #include <sodium.h>
 #include <unistd.h>
 
-#include "Platform/os/OpenFile.h"
 #include "Platform/os/RuntimeDirectory.h"
-#include "Platform/values/PropertyList.h"
 #include "Tools/tessary-platform/Command.h"
 
 int complain(int status, const std::string& text) {
@@ -31,16 +28,6 @@ std::unique_ptr<platform::FileSystem> openPreparedRoot(const Application& applic
   complain(kFailed,
            fmt::format("{}: {}", platform::runtimeDirectory(*files), prepared.error().message()));
   return nullptr;
-}
-
-std::expected<platform::Value, std::string> readPropertyListFile(const std::string& path) {
-  const platform::FileDescriptor file(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
-  if (!file.valid()) return std::unexpected(platform::Errno{errno}.message());
-  const auto bytes = platform::readToEnd(file.get(), platform::PropertyListLimits::kBytes);
-  if (!bytes) return std::unexpected(bytes.error().message());
-  auto value = platform::readPropertyList(*bytes);
-  if (!value) return std::unexpected(std::move(value.error().reason));
-  return *std::move(value);
 }
 
 int main(int argc, char** argv) {

@@ -2,24 +2,13 @@
 
 #include <fmt/format.h>
 
+#include "Tools/tessaryctl/Finish.h"
 #include "Tools/tessaryctl/ValueJSON.h"
 
 using tessary::Client;
 using tessary::ContainerName;
 
 namespace {
-
-// Prints the result of a call, or what went wrong.
-template <typename T, typename Print>
-int finish(const tessary::Result<T>& result, Print&& print) {
-  if (!result) return complain(result.error());
-  print(*result);
-  return kDone;
-}
-
-int finish(const tessary::Result<void>& result) {
-  return result ? kDone : complain(result.error());
-}
 
 int createOrLookup(Client& client, const Options& options, bool createIfNecessary) {
   const auto container = client.createOrLookup(

@@ -9,6 +9,13 @@
 #include "Tools/tessaryctl/Output.h"
 #include "Tools/tessaryctl/OwnRecord.h"
 
+// What `register` is to register: one of the files, or nothing to forget the identifier.
+struct Registration {
+  std::optional<std::string> infoFile;
+  std::optional<std::string> entitlementsFile;
+  tessary::RegistrationOptions options;
+};
+
 // The options of all subcommands; each reads its own.
 struct Options {
   OwnRecordOptions record;
@@ -21,6 +28,12 @@ struct Options {
   std::optional<std::string> ownerPersona;
   std::string key;
   std::optional<std::string> json;  // an info value
+  std::optional<std::string> owner;
+  Registration registration;
+  // Relative to a container, or to the directory for assets.
+  std::string source;
+  std::string destination;
+  tessary::UserManagedAssetsOptions assets;
 };
 
 using Command = int (*)(tessary::Client&, const Options&);
@@ -43,7 +56,17 @@ int deleteContainer(tessary::Client& client, const Options& options);
 int wipePluginData(tessary::Client& client, const Options& options);
 int deleteContent(tessary::Client& client, const Options& options);
 int systemPath(tessary::Client& client, const Options& options);
+int groups(tessary::Client& client, const Options& options);
+int groupIdentifiers(tessary::Client& client, const Options& options);
+int systemGroups(tessary::Client& client, const Options& options);
+int systemGroupPath(tessary::Client& client, const Options& options);
+int registerInfo(tessary::Client& client, const Options& options);
+int codeSigningInfo(tessary::Client& client, const Options& options);
+int invalidate(tessary::Client& client, const Options& options);
 int diskUsage(tessary::Client& client, const Options& options);
+int stageSharedContent(tessary::Client& client, const Options& options);
+int assetsPath(tessary::Client& client, const Options& options);
+int deleteAsset(tessary::Client& client, const Options& options);
 int retired(tessary::Client& client, const Options& options);
 int personas(tessary::Client& client, const Options& options);
 

@@ -76,6 +76,40 @@ void Output::print(const tessary::Metadata& metadata) const {
   if (metadata.sandboxToken) fmt::print("token       {}\n", *metadata.sandboxToken);
 }
 
+void Output::print(const std::vector<tessary::GroupContainer>& containers) const {
+  if (json) {
+    ordered_json list = ordered_json::array();
+    for (const auto& container : containers) {
+      ordered_json value = {{"identifier", container.identifier}, {"path", container.path}};
+      if (container.personaUniqueString) value["persona"] = *container.personaUniqueString;
+      if (container.sandboxToken) value["sandboxToken"] = *container.sandboxToken;
+      list.push_back(std::move(value));
+    }
+    printJSON(list);
+    return;
+  }
+  size_t width = std::string_view("GROUP").size();
+  for (const auto& container : containers) width = std::max(width, container.identifier.size());
+  fmt::print("{:<{}}  {}\n", "GROUP", width, "PATH");
+  for (const auto& container : containers) {
+    fmt::print("{:<{}}  {}\n", container.identifier, width, container.path);
+    const auto printBelow = [&](const char* what, const std::optional<std::string>& text) {
+      if (text) fmt::print("{:<{}}  {:<7}  {}\n", "", width, what, *text);
+    };
+    printBelow("persona", container.personaUniqueString);
+    printBelow("token", container.sandboxToken);
+  }
+}
+
+void Output::print(const tessary::UserManagedAssets& assets) const {
+  if (json) {
+    printJSON({{"path", assets.path}, {"existed", assets.existed}});
+    return;
+  }
+  fmt::print("path        {}\n", assets.path);
+  fmt::print("existed     {}\n", assets.existed ? "yes" : "no");
+}
+
 void Output::print(const std::string& key, const std::string& text) const {
   if (json) {
     printJSON({{key, text}});

@@ -17,6 +17,8 @@ struct Output {
   void print(const tessary::Container& container) const;
   void print(const std::vector<tessary::ListedContainer>& containers) const;
   void print(const tessary::Metadata& metadata) const;
+  void print(const std::vector<tessary::GroupContainer>& containers) const;
+  void print(const tessary::UserManagedAssets& assets) const;
   // One string under a key of its own.
   void print(const std::string& key, const std::string& text) const;
   void print(const std::string& key, const std::vector<std::string>& texts) const;

@@ -1,14 +1,11 @@
 #include "Tools/tessaryctl/OwnRecord.h"
 
-#include <fcntl.h>
 #include <fmt/format.h>
 #include <unistd.h>
 
-#include "Platform/base/FileDescriptor.h"
-#include "Platform/os/OpenFile.h"
 #include "Platform/os/RuntimeDirectory.h"
 #include "Platform/os/Tasks.h"
-#include "Platform/values/PropertyList.h"
+#include "Tools/PropertyListFile.h"
 
 using platform::FileSystem;
 using platform::TaskRecord;
@@ -26,18 +23,6 @@ std::shared_ptr<const Value::Dictionary> everyEntitlement() {
     entitlements.emplace(std::string(kPrefix) + name, true);
   }
   return std::make_shared<const Value::Dictionary>(std::move(entitlements));
-}
-
-std::expected<std::shared_ptr<const Value::Dictionary>, std::string> entitlementsIn(
-    const std::string& path) {
-  const platform::FileDescriptor file(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
-  if (!file.valid()) return std::unexpected(platform::Errno{errno}.message());
-  const auto bytes = platform::readToEnd(file.get(), platform::PropertyListLimits::kBytes);
-  if (!bytes) return std::unexpected(bytes.error().message());
-  auto value = platform::readPropertyList(*bytes);
-  if (!value) return std::unexpected(value.error().reason);
-  if (value->asDictionary() == nullptr) return std::unexpected("it holds no dictionary");
-  return std::make_shared<const Value::Dictionary>(std::move(*value->asDictionary()));
 }
 
 // Records are read and written by the user whom the daemon runs as.
@@ -73,11 +58,11 @@ std::optional<std::string> writeOwnRecord(const OwnRecordOptions& options) {
                     .sandboxed = options.sandboxed,
                     .personaUniqueString = options.persona};
   if (options.entitlementsFile) {
-    auto entitlements = entitlementsIn(*options.entitlementsFile);
+    auto entitlements = readDictionaryFile(*options.entitlementsFile);
     if (!entitlements) {
       return fmt::format("--entitlements {}: {}", *options.entitlementsFile, entitlements.error());
     }
-    record.entitlements = std::move(*entitlements);
+    record.entitlements = std::make_shared<const Value::Dictionary>(*std::move(entitlements));
   }
   const auto written = tasks.write(::getpid(), *startTime, record);
   if (!written) return fmt::format("cannot write a record: {}", written.error().message());

@@ -32,10 +32,11 @@ struct CommandLine {
     return command;
   }
 
-  // A subcommand that acts on the container of an identifier.
-  CLI::App* addNamed(const char* name, const char* description, Command action) {
+  // A subcommand that acts on an identifier, most often on its container.
+  CLI::App* addNamed(const char* name, const char* description, Command action,
+                     const char* identifier = "The container's identifier") {
     CLI::App* command = add(name, description, action);
-    command->add_option("identifier", options.identifier, "The container's identifier")->required();
+    command->add_option("identifier", options.identifier, identifier)->required();
     return command;
   }
 
@@ -51,6 +52,12 @@ struct CommandLine {
     CLI::App* command = addOfClass(name, description, action);
     command->add_option("--uuid", options.uuid, "Which one, when several have the identifier");
     return command;
+  }
+
+  // One that asks about what an owner has.
+  void addOwned(const char* name, const char* description, Command action) {
+    add(name, description, action)
+        ->add_option("owner", options.identifier, "Default: the caller's own identifier");
   }
 
   void addOwnIdentifier(CLI::App* command) {
@@ -70,6 +77,9 @@ struct CommandLine {
     addLookups();
     addRemovals();
     addQueries();
+    addGroups();
+    addCodeSigning();
+    addSharedContent();
     add("personas", "List the personas that the caller may see (command 32)", command::personas);
     add("retired", "Send the retired command 27", command::retired);
   }
@@ -124,6 +134,71 @@ struct CommandLine {
                       command::diskUsage)}) {
       addTransient(command);
     }
+  }
+
+  void addGroups() {
+    addOwned("groups", "The containers of an owner's application groups (command 13)",
+             command::groups);
+    addOwned("group-ids", "An owner's application groups (command 14)", command::groupIdentifiers);
+    addOwned("system-groups", "The containers of an owner's system groups (command 16)",
+             command::systemGroups);
+    CLI::App* path = add("system-group-path", "The path of a system group's container (command 17)",
+                         command::systemGroupPath);
+    path->add_option("group", options.identifier, "The group's identifier")->required();
+    path->add_option("--owner", options.owner, "Default: the caller's own identifier");
+  }
+
+  void addCodeSigning() {
+    addRegister();
+    addNamed("code-signing-info", "Print what an identifier is registered with (command 19)",
+             command::codeSigningInfo, "The code-signing identifier");
+    add("invalidate", "Invalidate entries without a bundle container (command 20)",
+        command::invalidate);
+  }
+
+  void addRegister() {
+    CLI::App* command =
+        addNamed("register", "Register what an identifier is entitled to (command 18)",
+                 command::registerInfo, "The code-signing identifier");
+    Registration& registration = options.registration;
+    auto* what = command->add_option_group("What to register");
+    what->require_option(1);
+    what->add_option("--info", registration.infoFile,
+                     "A property list: the code-signing information");
+    what->add_option("--entitlements", registration.entitlementsFile,
+                     "A property list: the entitlements alone. Those to ask with stand before the "
+                     "subcommand");
+    CLI::Option* forget = what->add_flag("--forget")->description("Forget the identifier");
+    for (CLI::Option* option :
+         {command->add_option("--class", registration.options.dataContainerClass,
+                              "The class of its data container"),
+          command->add_option("--parent", registration.options.parentIdentifier,
+                              "The application whose plug-in it is"),
+          command->add_flag("--placeholder", registration.options.placeholder,
+                            "It is not installed yet"),
+          command->add_flag("--advance-copy", registration.options.advanceCopy,
+                            "The same, until the next start of the device"),
+          command->add_flag("--by-caller", registration.options.registeredByCaller,
+                            "Its own process may change it")}) {
+      option->excludes(forget);
+    }
+  }
+
+  void addSharedContent() {
+    CLI::App* stage =
+        add("stage-shared", "Move an item within a system group's container (command 26)",
+            command::stageSharedContent);
+    stage->add_option("group", options.identifier, "One of the caller's own system groups")
+        ->required();
+    stage->add_option("source", options.source, "Relative to the container")->required();
+    stage->add_option("destination", options.destination, "Relative to the container")->required();
+    CLI::App* path = addNamed("assets-path", "The directory for user-managed assets (command 28)",
+                              command::assetsPath);
+    path->add_flag("--relative", options.assets.isRelative, "Relative to the container");
+    path->add_flag("--create", options.assets.createIfNecessary, "Make it when it is not there");
+    addNamed("delete-asset", "Delete a user-managed asset (command 29)", command::deleteAsset)
+        ->add_option("path", options.source, "Relative to the directory for assets")
+        ->required();
   }
 };
 

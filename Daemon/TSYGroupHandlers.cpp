@@ -1,0 +1,164 @@
+// Commands that tell an owner's groups and where they are.
+#include <algorithm>
+
+#include "Daemon/TSYCodeSigningMapping.h"
+#include "Daemon/TSYCommandHandlers.h"
+#include "Daemon/TSYGroupManager.h"
+#include "Daemon/TSYLog.h"
+#include "Daemon/TSYRequestResolvers.h"
+#include "Daemon/TSYWhitelist.h"
+
+using platform::Value;
+
+namespace {
+
+std::optional<std::string> ownerOf(const TSYRelayEvent& event,
+                                   const TSYClientConnection& connection) {
+  return TSYResolveIdentifier(event.request, connection, TSYIdentifierFallback::client);
+}
+
+Value::Dictionary pathsOf(const TSYClientConnection::GroupContainers& containers) {
+  Value::Dictionary paths;
+  for (const auto& [group, container] : containers) paths.emplace(group, container->url().path());
+  return paths;
+}
+
+// What a sandboxed client is told besides.
+void addPersonasAndTokens(const TSYClientConnection::GroupContainers& containers,
+                          const TSYClientIdentity& client, TSYRelayEvent& event) {
+  Value::Dictionary tokens;
+  Value::Dictionary personas;
+  for (const auto& [group, container] : containers) {
+    if (auto token = TSYIssueSandboxExtension(*container, client)) {
+      tokens.emplace(group, std::move(*token));
+    }
+    if (const auto persona = TSYPersonaUniqueStringOf(*container)) {
+      personas.emplace(group, *persona);
+    }
+  }
+  if (!tokens.empty()) event.reply.set("ReplySandboxTokenDict", std::move(tokens));
+  if (!personas.empty()) event.reply.set("ReplyPersonaUniqueStringDict", std::move(personas));
+}
+
+// The container of a group that the client's own entitlements name.
+TSYMetadataRef findEntitledGroup(TSYClientConnection& connection, const std::string& owner,
+                                 const TSYUserIdentityRef& userIdentity, const std::string& group) {
+  const auto containers = connection.groupContainersForOwnerIdentifier(
+      owner, userIdentity, kTSYContainerClassSystemGroup);
+  if (containers) {
+    const auto found = containers->find(group);
+    return found == containers->end() ? nullptr : found->second;
+  }
+  TSYLogWrite(TSYLogLevelError,
+              "No results returned for group container query for identity: {}, error: {}",
+              connection.clientBundleIdentifier(), containers.error().clientCode());
+  return nullptr;
+}
+
+// The container of a group that is open to every client.
+TSYMetadataRef findOpenGroup(TSYClientConnection& connection,
+                             const TSYUserIdentityRef& userIdentity, const std::string& group) {
+  connection.setAllowGroupIdLookup(/*allow=*/true);
+  const auto identity = TSYContainerIdentity::containerIdentityWithUserIdentity(
+      userIdentity, group, kTSYContainerClassSystemGroup);
+  if (!identity) {
+    TSYLogWrite(TSYLogLevelError,
+                "Could not generate a container identity for system group lookup identifier: {}, "
+                "class: {}, userIdentity: {}, error: {}",
+                group, kTSYContainerClassSystemGroup, userIdentity->shortDescription(),
+                identity.error().clientCode());
+    return nullptr;
+  }
+  const auto found = connection.createOrLookupContainerWithContainerIdentity(
+      *identity, /*createIfNecessary=*/true, /*transient=*/false, /*useLocking=*/true);
+  if (found) return *found;
+  TSYLogWrite(TSYLogLevelError,
+              "No results returned for system group lookup identity: {}, error: {}",
+              identity->description(), found.error().clientCode());
+  return nullptr;
+}
+
+}  // namespace
+
+uint64_t TSYHandleGroupContainersForOwner(TSYRelayEvent& event, TSYClientConnection& connection) {
+  const auto owner = ownerOf(event, connection);
+  if (!owner) return TSYErrorMissingIdentifier;
+  const auto userIdentity = TSYResolveUserIdentityForGroupOwner(connection, *owner);
+  if (!userIdentity) return userIdentity.error();
+  const auto containers = connection.groupContainersForOwnerIdentifier(*owner, *userIdentity,
+                                                                       kTSYContainerClassAppGroup);
+  if (!containers) return containers.error().clientCode();
+  event.reply.set("ReplyGroupContainerDict", pathsOf(*containers));
+  const TSYClientIdentityRef& client = connection.clientIdentity();
+  if (client->sandboxed()) addPersonasAndTokens(*containers, *client, event);
+  return TSYErrorSuccess;
+}
+
+uint64_t TSYHandleGroupIdentifiersForOwner(TSYRelayEvent& event, TSYClientConnection& connection) {
+  const auto owner = ownerOf(event, connection);
+  if (!owner) {
+    return TSYErrorCreate(TSYErrorInvalidObject, std::nullopt, TSYLogIt::yes,
+                          "Can't act on an invalid object: ID: {}", "(null)")
+        .code();
+  }
+  const auto groups = TSYGroupManager::defaultManager().groupContainerIdentifiersForOwnerIdentifier(
+      *owner, kTSYContainerClassAppGroup, /*useLocking=*/true);
+  if (!groups) return groups.error().clientCode();
+  event.reply.set("ReplyGroupIdentifiersArray", Value::Array(groups->begin(), groups->end()));
+  return TSYErrorSuccess;
+}
+
+uint64_t TSYHandleSystemGroupContainersForOwner(TSYRelayEvent& event,
+                                                TSYClientConnection& connection) {
+  const auto owner = ownerOf(event, connection);
+  if (!owner) return TSYErrorMissingIdentifier;
+  const auto userIdentity =
+      TSYResolveUserIdentityForIdentifier(connection, *owner, kTSYContainerClassSystemGroup);
+  if (!userIdentity) return userIdentity.error();
+  const auto containers = connection.groupContainersForOwnerIdentifier(
+      *owner, *userIdentity, kTSYContainerClassSystemGroup);
+  if (!containers) return containers.error().clientCode();
+  event.reply.set("ReplyGroupContainerDict", pathsOf(*containers));
+  return TSYErrorSuccess;
+}
+
+uint64_t TSYHandleSystemGroupContainerPath(TSYRelayEvent& event, TSYClientConnection& connection) {
+  const auto owner = ownerOf(event, connection);
+  if (!owner) return TSYErrorMissingIdentifier;
+  const std::string& client = connection.clientBundleIdentifier();
+  const auto entitled =
+      TSYCodeSigningMapping::sharedInstance().systemGroupIdentifiersForIdentifier(client).value_or(
+          std::vector<std::string>());
+  const std::string* given = event.request.string("GroupIdentifier");
+  const std::string group = given == nullptr ? "(null)" : *given;
+  TSYLogWrite(TSYLogLevelDebug, "Group ID: {}, bundle ID: {}, entitled group container IDs: {}",
+              group, client, fmt::join(entitled, ", "));
+  const auto userIdentity =
+      TSYResolveUserIdentityForIdentifier(connection, *owner, kTSYContainerClassSystemGroup);
+  if (!userIdentity) {
+    TSYLogWrite(TSYLogLevelError,
+                "Could not generate a user identity for bundle: {}, class: {}, error: {}", *owner,
+                kTSYContainerClassSystemGroup, userIdentity.error());
+    return userIdentity.error();
+  }
+  TSYMetadataRef container;
+  if (given != nullptr && std::ranges::find(entitled, group) != entitled.end()) {
+    container = findEntitledGroup(connection, *owner, *userIdentity, group);
+  } else if (given != nullptr &&
+             (TSYWhitelist::sharedWhitelist().systemGroupContainerIdIsWellknown(group) ||
+              connection.allowGroupIdLookup())) {
+    container = findOpenGroup(connection, *userIdentity, group);
+  } else {
+    TSYLogWrite(TSYLogLevelError,
+                "{} is not entitled for system group identifier: {}.  Only entitled for: {}",
+                client, group, fmt::join(entitled, ", "));
+    return TSYErrorNotEntitled;
+  }
+  if (!container) {
+    TSYLogWrite(TSYLogLevelError, "Did not find system group container with identifier: {} for {}",
+                group, *owner);
+    return TSYErrorNotFound;
+  }
+  event.reply.set("ReplyPath", container->url().path());
+  return TSYErrorSuccess;
+}

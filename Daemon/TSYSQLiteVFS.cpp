@@ -1,0 +1,32 @@
+// SQLite's own virtual file system but for one thing: it takes the name of a database as it is. Its
+// own would resolve it, to a path that may be longer than the 512 bytes that it takes.
+#include "Daemon/TSYSQLiteVFS.h"
+
+#include <sqlite3.h>
+
+namespace {
+
+constexpr char kName[] = "tessaryd";
+
+int takeAsItIs(sqlite3_vfs* /*vfs*/, const char* name, int size, char* fullName) {
+  sqlite3_snprintf(size, fullName, "%s", name);
+  return SQLITE_OK;
+}
+
+bool registerVFS() {
+  const sqlite3_vfs* own = sqlite3_vfs_find(nullptr);
+  if (own == nullptr) return false;
+  static sqlite3_vfs vfs = *own;
+  vfs.zName = kName;
+  vfs.pNext = nullptr;
+  vfs.xFullPathname = takeAsItIs;
+  return sqlite3_vfs_register(&vfs, /*makeDflt=*/0) == SQLITE_OK;
+}
+
+}  // namespace
+
+const char* TSYSQLiteVFSName() {
+  // One that cannot be registered is unknown to SQLite, which then says so.
+  [[maybe_unused]] static const bool isRegistered = registerVFS();
+  return kName;
+}
