@@ -87,7 +87,7 @@ struct RegistrationOptions {
   // Of the data container that belongs to the identifier; 0 for none.
   ContainerClass dataContainerClass = 0;
   // The identifier is a plug-in of this application, which must be registered already.
-  std::optional<std::string> parentIdentifier;
+  std::optional<std::string> parentIdentifier = std::nullopt;
   // What is not installed yet: it counts as a member of its groups, and codeSigningInfo() does not
   // answer it. An advance copy is forgotten when the device starts again.
   bool placeholder = false;

@@ -1,5 +1,6 @@
 // What start-up runs on the daemon's own connection.
 #include "Daemon/TSYClientConnection.h"
+#include "Daemon/TSYCodeSigningMapping.h"
 #include "Daemon/TSYContainerCache.h"
 #include "Daemon/TSYDaemonQueues.h"
 #include "Daemon/TSYException.h"
@@ -151,7 +152,16 @@ void TSYClientConnection::rebootTessaryCleanupWithCompletion(std::function<void(
       queueOrphanCleanup(TSYUserIdentityCache::defaultUserIdentity(), number);
     }
   }
+  TSYAsyncKeepingAlive(backgroundQueue(), _cleanupOprhanedCodeSigningMappingData);
   TSYAsyncKeepingAlive(backgroundQueue(), [completion = std::move(completion)] {
     if (completion) completion();
   });
+}
+
+// What was registered ahead of installations that the last shutdown cut short.
+void TSYClientConnection::_cleanupOprhanedCodeSigningMappingData() {
+  const auto removed = TSYCodeSigningMapping::sharedInstance().removeAllAdvanceCopies();
+  if (removed) return;
+  TSYLogWrite(TSYLogLevelError, "Could not remove advance copies of code sign data: {}",
+              removed.error());
 }

@@ -1,27 +1,24 @@
 // Commands of the installer about code-signing information.
 #include "Daemon/TSYCodeSigningMapping.h"
 #include "Daemon/TSYCommandHandlers.h"
-#include "Daemon/TSYLog.h"
+#include "Daemon/TSYPropertyList.h"
 #include "Daemon/TSYRequestResolvers.h"
-#include "Platform/values/PropertyList.h"
 
 using platform::Value;
 
 uint64_t TSYHandleRegisterCodeSigningInfo(TSYRelayEvent& event, TSYClientConnection& connection) {
+  const auto identifier =
+      TSYResolveIdentifier(event.request, connection, TSYIdentifierFallback::none);
   TSYCodeSigningMapping::Info info;
   if (const Value::Dictionary* given = event.request.dictionary("CodeSigningInfo")) {
     // What cannot be stored must not count as registered.
-    if (const auto form = platform::writeBinaryPropertyList(*given); !form) {
-      TSYLogWrite(TSYLogLevelError, "No property-list form of code signing info: {}",
-                  form.error().reason);
-      return TSYErrorInvalidArgument;
-    }
+    if (identifier && !TSYHasPropertyListForm(*given)) return TSYErrorInvalidArgument;
     info = std::make_shared<const Value::Dictionary>(*given);
   }
   const Value::Dictionary* options = event.request.dictionary("OptionsDictionary");
   return TSYCodeSigningMapping::sharedInstance().processCodeSigningInfo(
-      info, TSYResolveIdentifier(event.request, connection, TSYIdentifierFallback::none),
-      options == nullptr ? Value::Dictionary() : *options, connection.commandQueue());
+      info, identifier, options == nullptr ? Value::Dictionary() : *options,
+      connection.commandQueue());
 }
 
 uint64_t TSYHandleGetCodeSigningInfo(TSYRelayEvent& event, TSYClientConnection& connection) {

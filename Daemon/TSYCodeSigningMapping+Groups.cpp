@@ -73,7 +73,11 @@ void TSYCodeSigningMapping::deleteSystemContainer(const std::string& identifier,
                         "Failed to destroy system container with identifier {}: {}", identifier,
                         code);
           },
-          [this, identifier] { return !identifierHasSystemContainer(identifier); }));
+          [this, identifier] {
+            const auto entry = codeSigningEntryForIdentifier(identifier);
+            return entry &&
+                   !_entitlementsHasSystemContainer(_entitlementsFromCodeSigningEntry(*entry));
+          }));
 }
 
 void TSYCodeSigningMapping::_onQueue_handleChangeFromOldGroupContainerIds(
@@ -92,15 +96,15 @@ void TSYCodeSigningMapping::_onQueue_handleChangeFromOldGroupContainerIds(
 void TSYCodeSigningMapping::_onQueue_removeReferenceForGroupIdentifiers(
     const std::vector<std::string>& identifiers, TSYGroupType type, TSYCommandQueue& commandQueue) {
   if (identifiers.empty()) return;
+  if (type == TSYGroupType::system) {
+    TSYLogWrite(TSYLogLevelNotice, "Would have removed system group container references for {}",
+                textOf(identifiers));
+    return;
+  }
   const auto counts = _onQueue_copyReferenceCountSetOfType(type);
   if (!counts) {
     TSYLogWrite(TSYLogLevelError, "Failed to get reference count information for group type: {}",
                 static_cast<int64_t>(type));
-    return;
-  }
-  if (type == TSYGroupType::system) {
-    TSYLogWrite(TSYLogLevelNotice, "Would have removed system group container references for {}",
-                textOf(identifiers));
     return;
   }
   TSYGlobalConfiguration& configuration = TSYGlobalConfiguration::sharedInstance();

@@ -7,6 +7,7 @@
 #include "Daemon/TSYGlobalConfiguration.h"
 #include "Daemon/TSYLocks.h"
 #include "Daemon/TSYLog.h"
+#include "Daemon/TSYPropertyList.h"
 
 using platform::LogLevel;
 using platform::Value;
@@ -26,8 +27,10 @@ bool flagUnder(const Value::Dictionary& options, const char* key) {
 TSYCodeSigningEntry entryFor(const TSYCodeSigningMapping::Info& info,
                              const Value::Dictionary& options) {
   const Value* containerClass = optionUnder(options, kTSYOptionDataContainerClass);
-  TSYCodeSigningEntry entry(
-      info, containerClass == nullptr ? 0 : containerClass->unsignedOfNumber().value_or(0));
+  const uint64_t number =
+      containerClass == nullptr ? 0 : containerClass->unsignedOfNumber().value_or(0);
+  // As it will be read again.
+  TSYCodeSigningEntry entry(info, static_cast<uint32_t>(number));
   entry.registeredByCaller = flagUnder(options, kTSYOptionRegisteredByCaller);
   entry.placeholder = flagUnder(options, kTSYOptionPlaceholder);
   entry.advanceCopy = flagUnder(options, kTSYOptionAdvanceCopy);
@@ -68,10 +71,11 @@ uint64_t TSYCodeSigningMapping::processCallerRegisteredEntitlements(
   if (*entry) {
     TSYLogWrite(TSYLogLevelNotice, "{} has changed entitlements. Re-registering.", identifier);
   }
-  const TSYAllIdentifiersLock lock(TSYLockMode::writing, /*useLocking=*/true);
-  const Entitlements oldEntitlements = entitlementsForIdentifier(identifier);
   const auto info = std::make_shared<const Value::Dictionary>(
       Value::Dictionary{{kTSYCodeSigningEntitlements, entitlements}});
+  if (!TSYHasPropertyListForm(*info)) return TSYErrorInvalidArgument;
+  const TSYAllIdentifiersLock lock(TSYLockMode::writing, /*useLocking=*/true);
+  const Entitlements oldEntitlements = entitlementsForIdentifier(identifier);
   return onQueue([&]() -> uint64_t {
     queue_.assertCurrent();
     // The installer, or another request of the caller, may have been quicker.
@@ -145,7 +149,7 @@ TSYResult<void> TSYCodeSigningMapping::_onQueue_stageChild(const std::string& pa
   if (std::ranges::find(children, identifier) != children.end()) return {};
   children.push_back(identifier);
   TSYLogWrite(TSYLogLevelDebug, "Staging Child Bundles: {} for parent ID: {} by appending: {}",
-              fmt::join(children, ", "), parent, identifier);
+              fmt::format("({})", fmt::join(children, ", ")), parent, identifier);
   entry.childBundleIdentifiers = std::move(children);
   writes.emplace_back(parent, std::move(entry));
   return {};

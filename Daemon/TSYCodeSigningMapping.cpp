@@ -30,8 +30,7 @@ bool isPlugInClass(uint64_t dataContainerClass) {
          dataContainerClass <= kTSYContainerClassVPNPluginData;
 }
 
-// The regular bundle container of an identifier. One that there might be, but that cannot be looked
-// for, is a failure other than 21.
+// The regular bundle container of an identifier.
 TSYResult<TSYMetadataRef> findBundle(const std::string& identifier,
                                      TSYContainerClass containerClass) {
   auto identity = TSYContainerIdentity::containerIdentityWithIdentifier(identifier, containerClass);
@@ -40,12 +39,14 @@ TSYResult<TSYMetadataRef> findBundle(const std::string& identifier,
       *identity, /*transient=*/false, /*updateSandbox=*/false);
 }
 
+// A bundle that cannot be looked for counts as there.
 bool mayHaveBundle(const std::string& identifier) {
   constexpr std::array kClasses = {kTSYContainerClassAppBundle, kTSYContainerClassPluginBundle,
                                    kTSYContainerClassVPNPluginBundle};
   return std::ranges::any_of(kClasses, [&](TSYContainerClass containerClass) {
     const auto found = findBundle(identifier, containerClass);
-    return found || !found.error().is(TSYErrorNotFound);
+    return found ||
+           !(found.error().is(TSYErrorNotFound) || found.error().is(TSYErrorCacheInconsistent));
   });
 }
 
@@ -144,9 +145,9 @@ TSYCodeSigningMapping::Entitlements TSYCodeSigningMapping::_onQueue_entitlements
 TSYCodeSigningMapping::Entitlements TSYCodeSigningMapping::entitlementsForIdentifier(
     const std::string& identifier) {
   const auto entry = codeSigningEntryForIdentifier(identifier);
-  if (entry) {
-    if (auto entitlements = _entitlementsFromCodeSigningEntry(*entry)) return entitlements;
-  }
+  // One that cannot be read is there all the same.
+  if (!entry) return nullptr;
+  if (*entry) return _entitlementsFromCodeSigningEntry(*entry);
   return takeOverFromBundleContainer(identifier);
 }
 
@@ -166,15 +167,20 @@ TSYCodeSigningMapping::Entitlements TSYCodeSigningMapping::takeOverFromBundleCon
   }
   const TSYCodeSigningEntry entry(std::make_shared<const Value::Dictionary>(std::move(info)),
                                   kTSYContainerClassAppData);
-  onQueue([&] {
+  return onQueue([&]() -> Entitlements {
     queue_.assertCurrent();
+    // What has been registered meanwhile is newer.
+    const auto now = _onQueue_codeSigningEntryForIdentifier(identifier);
+    if (!now) return nullptr;
+    if (*now) return _entitlementsFromCodeSigningEntry(*now);
     const auto added =
         _onQueue_change([&](TSYSQLiteDB& db) { return db.addCodeSigningEntry(entry, identifier); });
-    if (added) return;
-    TSYLogWrite(TSYLogLevelError, "Failed to write code signing info to DB for {} : {}", identifier,
-                added.error());
+    if (!added) {
+      TSYLogWrite(TSYLogLevelError, "Failed to write code signing info to DB for {} : {}",
+                  identifier, added.error());
+    }
+    return _entitlementsFromInfo(entry.codeSigningInfo);
   });
-  return _entitlementsFromInfo(entry.codeSigningInfo);
 }
 
 TSYCodeSigningMapping::Identifiers TSYCodeSigningMapping::appGroupIdentifiersForIdentifier(
@@ -258,9 +264,15 @@ TSYResult<void> TSYCodeSigningMapping::invalidateCodeSigningInfoForIdentifierAnd
     const std::string& identifier) {
   return onQueue([&] {
     queue_.assertCurrent();
-    return _onQueue_change([&](TSYSQLiteDB& db) {
-      return db.invalidateCodeSigningForIdentifierAndAllChildren(identifier);
-    });
+    return _onQueue_invalidateCodeSigningInfoForIdentifierAndItsChildren(identifier);
+  });
+}
+
+TSYResult<void>
+TSYCodeSigningMapping::_onQueue_invalidateCodeSigningInfoForIdentifierAndItsChildren(
+    const std::string& identifier) {
+  return _onQueue_change([&](TSYSQLiteDB& db) {
+    return db.invalidateCodeSigningForIdentifierAndAllChildren(identifier);
   });
 }
 
@@ -313,7 +325,13 @@ TSYResult<void> TSYCodeSigningMapping::invalidateUnlessBundled(const std::string
   if ((*entry)->registeredByCaller || hasParent || mayHaveBundle(identifier)) return {};
   TSYLogWrite(TSYLogLevelNotice, "Invalidating: identifier = {}, isPlugin = {:d}", identifier,
               isPlugIn);
-  const auto invalidated = invalidateCodeSigningInfoForIdentifierAndItsChildren(identifier);
+  const auto invalidated = onQueue([&]() -> TSYResult<void> {
+    queue_.assertCurrent();
+    // What has been registered meanwhile is not what was looked at.
+    const auto now = _onQueue_codeSigningEntryForIdentifier(identifier);
+    if (!now || !*now || **now != **entry) return {};
+    return _onQueue_invalidateCodeSigningInfoForIdentifierAndItsChildren(identifier);
+  });
   if (invalidated) return {};
   return TSYFailure(TSYErrorCreate(TSYErrorDatabase, std::nullopt, TSYLogIt::yes,
                                    "Failed to invalidate code signing info for {} : {}", identifier,

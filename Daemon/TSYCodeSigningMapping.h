@@ -58,7 +58,7 @@ class TSYCodeSigningMapping {
                                   TSYCommandQueue& commandQueue);
   // Registers what a caller of the daemon is entitled to, unless the installer has registered him
   // or nothing has changed. Takes the global write lock when there is something to register.
-  // Returns 1, or 66, 40.
+  // Returns 1, or 38 for what has no property-list form, 66, 40.
   uint64_t processCallerRegisteredEntitlements(const platform::Value::Dictionary& entitlements,
                                                const std::string& identifier,
                                                TSYCommandQueue& commandQueue);
@@ -198,6 +198,8 @@ class TSYCodeSigningMapping {
       REQUIRES(queue_);
   bool isReferenced(const std::string& group);
 
+  TSYResult<void> _onQueue_invalidateCodeSigningInfoForIdentifierAndItsChildren(
+      const std::string& identifier) REQUIRES(queue_);
   TSYResult<void> invalidateUnlessBundled(const std::string& identifier);
   Entitlements takeOverFromBundleContainer(const std::string& identifier);
 

@@ -60,8 +60,11 @@ Rights rightsOf(const TSYClientIdentity& client, const TSYCommandRow& row) {
 }
 
 void registerCaller(const TSYClientIdentity& client, TSYCommandQueue& commandQueue) {
-  const uint64_t code = TSYCodeSigningMapping::sharedInstance().processCallerRegisteredEntitlements(
-      client.entitlements(), client.bundleIdentifier(), commandQueue);
+  const auto processed = TSYCatchingExceptions([&]() -> TSYResult<uint64_t> {
+    return TSYCodeSigningMapping::sharedInstance().processCallerRegisteredEntitlements(
+        client.entitlements(), client.bundleIdentifier(), commandQueue);
+  });
+  const uint64_t code = processed ? *processed : processed.error().clientCode();
   if (code != TSYErrorSuccess) {
     TSYLogWrite(TSYLogLevelError, "Error processing entitlements for {} : {}",
                 client.bundleIdentifier(), code);

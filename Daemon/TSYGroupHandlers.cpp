@@ -131,8 +131,9 @@ uint64_t TSYHandleSystemGroupContainerPath(TSYRelayEvent& event, TSYClientConnec
           std::vector<std::string>());
   const std::string* given = event.request.string("GroupIdentifier");
   const std::string group = given == nullptr ? "(null)" : *given;
+  const std::string entitledText = fmt::format("({})", fmt::join(entitled, ", "));
   TSYLogWrite(TSYLogLevelDebug, "Group ID: {}, bundle ID: {}, entitled group container IDs: {}",
-              group, client, fmt::join(entitled, ", "));
+              group, client, entitledText);
   const auto userIdentity =
       TSYResolveUserIdentityForIdentifier(connection, *owner, kTSYContainerClassSystemGroup);
   if (!userIdentity) {
@@ -151,7 +152,7 @@ uint64_t TSYHandleSystemGroupContainerPath(TSYRelayEvent& event, TSYClientConnec
   } else {
     TSYLogWrite(TSYLogLevelError,
                 "{} is not entitled for system group identifier: {}.  Only entitled for: {}",
-                client, group, fmt::join(entitled, ", "));
+                client, group, entitledText);
     return TSYErrorNotEntitled;
   }
   if (!container) {

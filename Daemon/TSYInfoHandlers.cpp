@@ -1,8 +1,7 @@
 // Commands that read or change one existing container.
 #include "Daemon/TSYCommandHandlers.h"
-#include "Daemon/TSYLog.h"
+#include "Daemon/TSYPropertyList.h"
 #include "Daemon/TSYRequestResolvers.h"
-#include "Platform/values/PropertyList.h"
 
 using platform::Value;
 
@@ -24,11 +23,7 @@ uint64_t TSYHandleSetInfoValue(TSYRelayEvent& event, TSYClientConnection& connec
   if (!identity) return identity.error();
   std::optional<Value> value;
   if (const Value* given = event.request.value("Value")) {
-    if (const auto form = platform::writeBinaryPropertyList(*given); !form) {
-      TSYLogWrite(TSYLogLevelError, "No property-list form of an info value: {}",
-                  form.error().reason);
-      return TSYErrorInvalidArgument;
-    }
+    if (!TSYHasPropertyListForm(*given)) return TSYErrorInvalidArgument;
     value = *given;
   }
   return codeOf(connection.setInfoValue(value, keyOf(event), *identity, /*useLocking=*/true));

@@ -1,5 +1,6 @@
 #include "Daemon/TSYPropertyList.h"
 
+#include "Daemon/TSYLog.h"
 #include "Platform/os/Platform.h"
 #include "Platform/values/PropertyList.h"
 
@@ -49,6 +50,12 @@ TSYResult<Value::Dictionary> TSY_dictionaryWithContentsOfURL(const TSYURL& url) 
         platform::Errno{EILSEQ}, "{} holds no dictionary but a {}", url.path(), value->typeName()));
   }
   return std::move(*dictionary);
+}
+
+bool TSYHasPropertyListForm(const Value& value) {
+  const auto form = platform::writeBinaryPropertyList(value);
+  if (!form) TSYLogWrite(TSYLogLevelError, "No property-list form: {}", form.error().reason);
+  return form.has_value();
 }
 
 bool containsDotDotPathComponents(std::string_view path) {

@@ -24,5 +24,8 @@ TSYResult<void> TSY_writeToURL(const platform::Value::Dictionary& dictionary, co
 // Reads a file of at most 16 MiB that holds a dictionary, in any property-list format.
 TSYResult<platform::Value::Dictionary> TSY_dictionaryWithContentsOfURL(const TSYURL& url);
 
+// Whether a value from outside can be stored at all: the reason why not is logged.
+bool TSYHasPropertyListForm(const platform::Value& value);
+
 // Whether a component of the path, split on "/", equals "..".
 bool containsDotDotPathComponents(std::string_view path);

@@ -41,6 +41,20 @@ FileDescriptor openDirectory(const TSYURL& url) {
   return directory ? std::move(*directory) : FileDescriptor();
 }
 
+// Ends a transaction that nobody has ended: whatever went wrong, the next one must find none open.
+class NoTransactionLeft {
+ public:
+  explicit NoTransactionLeft(sqlite3* db) : db_(db) {}
+  ~NoTransactionLeft() {
+    if (sqlite3_get_autocommit(db_) == 0) sqlite3_exec(db_, "ROLLBACK;", nullptr, nullptr, nullptr);
+  }
+  NoTransactionLeft(const NoTransactionLeft&) = delete;
+  NoTransactionLeft& operator=(const NoTransactionLeft&) = delete;
+
+ private:
+  sqlite3* const db_;
+};
+
 int withoutHigherBits(uint64_t number) {
   return static_cast<int>(static_cast<uint32_t>(number));
 }
@@ -187,6 +201,7 @@ TSYResult<void> TSYSQLiteDB::_sqliteExec(const char* sql) {
 }
 
 TSYResult<void> TSYSQLiteDB::inTransaction(const std::function<TSYResult<void>()>& work) {
+  const NoTransactionLeft atTheEnd(db_);
   if (const auto begun = _sqliteExec("BEGIN;"); !begun) {
     return TSYFailure(
         TSYErrorCreate(TSYErrorDatabase, begun.error(), TSYLogIt::yes, "failed _sqliteExec begin"));
@@ -197,8 +212,6 @@ TSYResult<void> TSYSQLiteDB::inTransaction(const std::function<TSYResult<void>()
   if (const auto committed = _sqliteExec("COMMIT;"); !committed) {
     (void)TSYErrorCreate(TSYErrorDatabase, committed.error(), TSYLogIt::yes,
                          "failed _sqliteExec commit");
-    // One that stayed open would be in the way of every later one.
-    if (sqlite3_get_autocommit(db_) == 0) (void)_sqliteExec("ROLLBACK;");
   }
   return {};
 }
@@ -241,8 +254,10 @@ TSYResult<void> TSYSQLiteDB::addCodeSigningEntry(const TSYCodeSigningEntry& entr
     for (const std::string& child : *entry.childBundleIdentifiers) {
       const auto added = _insertChildIdentifier(child, identifier);
       if (added) continue;
-      (void)TSYErrorCreate(TSYErrorDatabase, added.error(), TSYLogIt::yes,
-                           "Error performing INSERT operation for child {}", child);
+      auto failure = TSYErrorCreate(TSYErrorDatabase, added.error(), TSYLogIt::yes,
+                                    "Error performing INSERT operation for child {}", child);
+      // Some failures, such as a full disk, have rolled back the rest already.
+      if (sqlite3_get_autocommit(db_) != 0) return TSYFailure(std::move(failure));
     }
     return {};
   });

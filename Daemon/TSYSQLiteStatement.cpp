@@ -32,6 +32,7 @@ const char* TSYSQLiteStatement::text(int column) {
 }
 
 std::span<const uint8_t> TSYSQLiteStatement::bytes(int column) {
+  if (sqlite3_column_type(statement_, column) != SQLITE_BLOB) return {};
   const auto* first = static_cast<const uint8_t*>(sqlite3_column_blob(statement_, column));
   const int size = sqlite3_column_bytes(statement_, column);
   if (first == nullptr) return {};

@@ -30,7 +30,7 @@ class TSYSQLiteStatement {
   // What the current row holds, until the next step. Null for NULL.
   const char* text(int column);
   int number(int column) { return sqlite3_column_int(statement_, column); }
-  // Empty for NULL.
+  // Empty for what is no blob.
   std::span<const uint8_t> bytes(int column);
 
  private:

@@ -1,5 +1,6 @@
 // SQLite's own virtual file system but for one thing: it takes the name of a database as it is. Its
-// own would resolve it, to a path that may be longer than the 512 bytes that it takes.
+// own would resolve it, to a path that may be longer than the 512 bytes that it takes. And nothing
+// is put aside in temporary files, which would lie outside the root.
 #include "Daemon/TSYSQLiteVFS.h"
 
 #include <sqlite3.h>
@@ -14,6 +15,8 @@ int takeAsItIs(sqlite3_vfs* /*vfs*/, const char* name, int size, char* fullName)
 }
 
 bool registerVFS() {
+  constexpr int kNever = -1;
+  sqlite3_config(SQLITE_CONFIG_STMTJRNL_SPILL, kNever);
   const sqlite3_vfs* own = sqlite3_vfs_find(nullptr);
   if (own == nullptr) return false;
   static sqlite3_vfs vfs = *own;

@@ -8,6 +8,7 @@
 
 #include <cstdlib>
 #include <utility>
+#include <vector>
 
 namespace platform {
 namespace {
@@ -15,7 +16,7 @@ namespace {
 // The queues whose work the calling thread is running, innermost last: synchronous work of one
 // queue may make a synchronous call on another.
 thread_local const SerialQueue* currentQueue = nullptr;
-thread_local std::deque<const SerialQueue*> outerQueues;
+thread_local std::vector<const SerialQueue*> outerQueues;
 
 void lowerPriorityOfCallingThread() {
   constexpr int kWhoProcess = 1;       // IOPRIO_WHO_PROCESS
@@ -133,6 +134,8 @@ void SerialQueue::runThread() {
 
 SerialQueue::Turn::Turn(SerialQueue& queue) : queue_(queue), outer_(currentQueue) {
   if (queue.isCurrent()) stop(queue.label_, "a synchronous call waits for itself");
+  // From the turn on nothing may fail.
+  outerQueues.reserve(outerQueues.size() + 1);
   {
     const MutexLock lock(queue.mutex_);
     const uint64_t ticket = queue.nextTicket_++;
