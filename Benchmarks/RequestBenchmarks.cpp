@@ -1,6 +1,7 @@
 // Requests beside a bare echo server on the same kind of socket, in turns, so that a drift of the
 // machine's speed meets both.
 #include <benchmark/benchmark.h>
+#include <fmt/format.h>
 #include <sched.h>
 
 #include <atomic>
@@ -9,20 +10,34 @@
 
 #include "Benchmarks/Samples.h"
 #include "Benchmarks/Scratch.h"
+#include "Client/Client.h"
 
 namespace {
 
 using Clock = std::chrono::steady_clock;
 
-// One container that is there, and an echo server for frames of the size of its lookup.
+// One container that is there, so many identifiers with code-signing information, and an echo
+// server for frames of the size of the container's lookup.
 struct LookupSetUp {
-  LookupSetUp() {
+  explicit LookupSetUp(int registered = 0) {
     device.start();
+    registerIdentifiers(registered);
     const platform::FileDescriptor socket = device.connect();
     roundTripOfFrame(socket.get(), createFrame("com.example.application"));
     request = lookupFrame("com.example.application");
     replySize = roundTripOfFrame(socket.get(), request).size();
     echo = std::make_unique<EchoServer>(request.size(), replySize);
+  }
+
+  void registerIdentifiers(int count) const {
+    auto client = tessary::Client::connect(device.root());
+    for (int i = 0; client && i < count; ++i) {
+      const auto done = client->registerCodeSigningInfo(
+          fmt::format("com.example.registered{}", i),
+          platform::Value::Dictionary{{"com.veltra.Tessary.Entitlements",
+                                       platform::Value::Dictionary{{"com.example.right", true}}}});
+      if (!done) die(done.error().text);
+    }
   }
 
   ScratchDevice device;
@@ -56,7 +71,8 @@ void lookupRoundTrip(benchmark::State& state) {
   const OneProcessor processor;
   constexpr int kRoundTrips = 20'000;
   const auto roundTripsPerTurn = static_cast<int>(state.range(0));
-  const LookupSetUp setUp;
+  constexpr int kRegistered = 10'000;
+  const LookupSetUp setUp(kRegistered);
   const platform::FileDescriptor daemon = setUp.device.connect();
   const platform::FileDescriptor bare = setUp.echo->connect();
   for (auto _ : state) {

@@ -144,6 +144,31 @@ class TSYClientConnection {
       const std::string& ownerIdentifier, const TSYUserIdentityRef& userIdentity,
       TSYContainerClass groupContainerClass);
 
+  // --- User-managed assets and staged shared content ---------------------------------------------
+  // Paths that a client gives are relative, and nothing outside the container's own directory is
+  // reached through them, whatever its owner does to it meanwhile.
+
+  struct UserManagedAssets {
+    std::string path;
+    bool existed;
+  };
+  // The directory in which a client keeps content that its user manages, absolute or relative to
+  // the container. Codes 38 for another's container without the entitlement, 11, 71 (not logged)
+  // when there is none and none is to be made, 6, 45, 40 and those of the metadata file.
+  TSYResult<UserManagedAssets> userManagedAssetsPathWithContainerIdentity(
+      const TSYContainerIdentity& identity, bool isRelative, bool createIfNecessary);
+  // Moves one item of that directory to death row. `relativePath` is relative to it. Codes 11, 10
+  // for what is not inside it, 41, 40. Returns 1 or the code.
+  uint64_t deleteUserManagedAssetWithContainerIdentity(
+      const TSYContainerIdentity& identity, const std::optional<std::string>& relativePath);
+  // Moves an item within a system group container that the caller is entitled to, with its
+  // access-control lists standardised; both paths are relative to the container. Returns where the
+  // item is now. Codes 18 without an identifier, 11, 38, 55, 21, 10, 63, 64, 40.
+  TSYResult<TSYURL> stageSharedContentForIdentifier(
+      const std::optional<std::string>& identifier,
+      const std::optional<std::string>& sourceRelativePath,
+      const std::optional<std::string>& destRelativePath);
+
   // --- Boot --------------------------------------------------------------------------------------
 
   // Run at every start, before any request is served: repairs replaces that were cut short.
@@ -185,6 +210,7 @@ class TSYClientConnection {
   void sentence(const TSYURL& url, std::string_view kind);
   void sentenceTransientContainers();
   void queueOrphanCleanup(const TSYUserIdentityRef& userIdentity, TSYContainerClass containerClass);
+  static void _cleanupOprhanedCodeSigningMappingData();
   void _cleanupOrphanedDataForDirectories(const std::optional<std::vector<TSYURL>>& directories,
                                           TSYContainerClass containerClass);
 
@@ -216,6 +242,15 @@ class TSYClientConnection {
   TSYResult<void> regenerateDirectoryUUID(const TSYConcreteContainerIdentity& identity);
   TSYResult<uint64_t> diskUsage(const TSYConcreteContainerIdentity& identity);
   void _regenerateAllSystemContainerPaths();
+
+  TSYResult<UserManagedAssets> userManagedAssetsPath(const TSYContainerIdentity& identity,
+                                                     bool isRelative, bool createIfNecessary);
+  TSYResult<void> deleteUserManagedAsset(const TSYContainerIdentity& identity,
+                                         const std::optional<std::string>& relativePath);
+  TSYResult<TSYURL> stageSharedContent(const std::optional<std::string>& identifier,
+                                       const std::optional<std::string>& sourceRelativePath,
+                                       const std::optional<std::string>& destRelativePath);
+  bool isMemberOfSystemGroup(const std::string& group) const;
 
   static uint64_t emptyDeathRow();
   static TSYResult<void> _removeItemOrMoveToTempAtURL(const TSYURL& url);

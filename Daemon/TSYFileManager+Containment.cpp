@@ -195,6 +195,13 @@ std::optional<TSYURL> TSYFileManager::realPathForURL(const TSYURL& suspicious,
   return TSYURL(std::move(*realSuspicious));
 }
 
+TSYResult<TSYURL> TSYFileManager::realPathOfItemAtURL(const TSYURL& url) {
+  auto resolved = files().resolve(url.path());
+  if (resolved) return TSYURL(std::move(*resolved));
+  return TSYFailure(TSYPosixErrorCreate(resolved.error(), "realpath of {} failed: {}", url.path(),
+                                        resolved.error().message()));
+}
+
 TSYURL TSYFileManager::homeDirectoryURLForPOSIXUID(uid_t uid) {
   const auto account = platform::Platform::current().accounts.accountWithUID(uid);
   if (account) {

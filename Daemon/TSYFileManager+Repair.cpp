@@ -1,6 +1,9 @@
 // Repairs of owners, modes and access-control lists, over whole trees and item by item.
 #include <sys/stat.h>
 
+#include <chrono>
+#include <thread>
+
 #include "Daemon/TSYFileManager.h"
 #include "Daemon/TSYLog.h"
 #include "Daemon/TSYMetadata.h"
@@ -96,42 +99,76 @@ TSYResult<gid_t> systemUsersGroup() {
 
 // Inside a system container access is granted by the list alone. The order is owner, mode, list:
 // a change of mode would narrow what the list grants.
+//
+// Many may write into one, and change names while it is repaired. So each item is held, and all
+// three are done to what is held. A file that has another name as well may be somebody else's that
+// was linked here to be opened to all: it is left alone.
 class ACLRepair {
  public:
   ACLRepair(bool isSystemContainer, gid_t group)
       : isSystemContainer_(isSystemContainer), group_(group) {}
 
-  void repair(const FileSystem::WalkEntry& entry) const {
+  void repair(const FileSystem::WalkEntry& entry) {
     if (entry.isRoot && isSystemContainer_ && S_ISDIR(entry.status.st_mode)) {
-      set(entry, ACLShape::topLevelDirectory);
+      report(platform::setACL(entry.parent, entry.name, ACLShape::topLevelDirectory, group_),
+             "top level ACL", entry.path);
       return;
     }
-    changeOwner(entry.parent, entry.name, entry.path, platform::kNobodyAccount,
-                platform::kNobodyAccount);
-    if (S_ISLNK(entry.status.st_mode)) return;
-    changeMode(entry.parent, entry.name, entry.path, 0);
-    set(entry, S_ISDIR(entry.status.st_mode) ? ACLShape::directory : ACLShape::file);
-    if (files().privilege() == platform::Privilege::none) {
-      changeMode(entry.parent, entry.name, entry.path, kUnprivilegedMode);
+    const auto item = hold(entry.parent, entry.name);
+    struct stat status{};
+    if (!item || ::fstat(item->get(), &status) != 0) {
+      const Errno error = item ? Errno{errno} : item.error();
+      TSYLogWrite(TSYLogLevelError, "Could not open {} to repair it: {}", entry.path,
+                  error.message());
+      return;
     }
+    repair(item->get(), status.st_mode, entry.path);
   }
 
  private:
-  void set(const FileSystem::WalkEntry& entry, ACLShape shape) const {
-    const auto applied = platform::setACL(entry.parent, entry.name, shape, group_);
-    if (applied) return;
-    if (buildingError(applied.error())) return;  // logged
-    const std::string reason = applied.error().error.message();
-    if (shape == ACLShape::topLevelDirectory) {
-      TSYLogWrite(TSYLogLevelError, "Failed to set top level ACL on dir {}: {}", entry.path,
-                  reason);
-    } else {
-      TSYLogWrite(TSYLogLevelError, "Failed to set ACL on dir {}: {}", entry.path, reason);
+  void repair(int item, mode_t mode, const std::string& path) const {
+    const auto owned = files().setOwner(item, platform::kNobodyAccount, platform::kNobodyAccount);
+    if (!owned) {
+      TSYLogWrite(TSYLogLevelError, "Could not chown {}: {}", path, owned.error().message());
+    }
+    if (S_ISLNK(mode)) return;
+    setMode(item, 0, path);
+    report(platform::setACL(item, S_ISDIR(mode) ? ACLShape::directory : ACLShape::file, group_),
+           "ACL", path);
+    if (files().privilege() == platform::Privilege::none) setMode(item, kUnprivilegedMode, path);
+  }
+
+  static void setMode(int item, mode_t mode, const std::string& path) {
+    const auto changed = files().setMode(item, mode);
+    if (changed) return;
+    TSYLogWrite(TSYLogLevelError, "Could not chmod {}: {}", path, changed.error().message());
+  }
+
+  static void report(const platform::ACLResult<void>& applied, std::string_view list,
+                     const std::string& path) {
+    if (applied || buildingError(applied.error())) return;  // the second is logged
+    TSYLogWrite(TSYLogLevelError, "Failed to set {} on dir {}: {}", list, path,
+                applied.error().error.message());
+  }
+
+  // What was changed just now has to rest for a tick of the clock. Somebody who goes on changing
+  // things is not waited for without end.
+  platform::Result<platform::FileDescriptor> hold(int parent, const std::string& name) {
+    constexpr int kWaitsForOne = 8;
+    constexpr int kWaitsForAll = 512;
+    constexpr std::chrono::milliseconds kWait{2};
+    for (int wait = 0;; ++wait) {
+      auto item = files().holdOnlyName(parent, name);
+      if (item || item.error() != Errno{EAGAIN}) return item;
+      if (wait == kWaitsForOne || waits_ == kWaitsForAll) return item;
+      ++waits_;
+      std::this_thread::sleep_for(kWait);
     }
   }
 
   const bool isSystemContainer_;
   const gid_t group_;
+  int waits_ = 0;
 };
 
 }  // namespace
@@ -175,7 +212,7 @@ TSYResult<void> TSYFileManager::setTopLevelSystemContainerACLAtURL(const TSYURL&
 TSYResult<void> TSYFileManager::standardizeACLsAtURL(const TSYURL& url, bool isSystemContainer) {
   const auto group = systemUsersGroup();
   if (!group) return TSYFailure(group.error());
-  const ACLRepair repair(isSystemContainer, *group);
+  ACLRepair repair(isSystemContainer, *group);
   return traverseDirectory(url, [&](const FileSystem::WalkEntry& entry) { repair.repair(entry); });
 }
 

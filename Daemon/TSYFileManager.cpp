@@ -32,6 +32,11 @@ TSYError creationError(const std::string& path, bool withIntermediateDirectories
              : TSYPosixErrorCreate(error, "mkdir of {} failed: {}", path, error.message());
 }
 
+TSYError temporaryDirectoryError(const TSYURL& parent, const std::string& prefix, Errno error) {
+  return TSYPosixErrorCreate(error, "Failed to create temp dir at path {} : {}",
+                             parent.appending(prefix + "XXXXXX").path(), error.message());
+}
+
 // Whether an allowed missing source ends the operation.
 TSYResult<bool> isMissing(const TSYURL& source) {
   const auto exists = files().exists(source.path());
@@ -232,9 +237,17 @@ TSYResult<TSYURL> TSYFileManager::createTemporaryDirectoryInDirectoryURL(
     const TSYURL& parent, const std::string& prefix) {
   auto made = files().makeTemporaryDirectory(parent.path(), prefix);
   if (made) return TSYURL(std::move(*made));
-  return TSYFailure(TSYPosixErrorCreate(made.error(), "Failed to create temp dir at path {} : {}",
-                                        parent.appending(prefix + "XXXXXX").path(),
-                                        made.error().message()));
+  return TSYFailure(temporaryDirectoryError(parent, prefix, made.error()));
+}
+
+TSYResult<TSYFileManager::OpenDirectory> TSYFileManager::createOpenTemporaryDirectoryInDirectoryURL(
+    const TSYURL& parent, const std::string& prefix) {
+  auto made = files().makeOpenTemporaryDirectory(parent.path(), prefix);
+  if (made) {
+    return OpenDirectory{.url = parent.appending(made->name),
+                         .descriptor = std::move(made->directory)};
+  }
+  return TSYFailure(temporaryDirectoryError(parent, prefix, made.error()));
 }
 
 TSYResult<std::vector<TSYURL>> TSYFileManager::urlsForItemsInDirectoryAtURL(
@@ -272,6 +285,19 @@ bool TSYFileManager::itemDoesNotExistAtURL(const TSYURL& url) {
   TSYLogWrite(TSYLogLevelError, "Failed to determine if {} exists: {}", url.path(),
               exists.error().message());
   return false;
+}
+
+TSYResult<bool> TSYFileManager::directoryExistsAtURL(const TSYURL& url) {
+  const auto status = files().status(url.path());
+  if (status) return S_ISDIR(status->st_mode);
+  const Errno error = status.error();
+  for (const int missing : {ENOENT, ENOTDIR, ELOOP, ENAMETOOLONG}) {
+    if (error.value == missing) return false;
+  }
+  TSYLogWrite(TSYLogLevelError, "Failed to determine if {} exists: {}", url.path(),
+              error.message());
+  return TSYFailure(
+      TSYPosixErrorCreate(error, "stat of {} failed: {}", url.path(), error.message()));
 }
 
 TSYResult<int> TSYFileManager::dataProtectionClassOfItemAtURL(const TSYURL& url) {

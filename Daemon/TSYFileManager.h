@@ -19,6 +19,7 @@
 
 #include "Daemon/TSYError.h"
 #include "Daemon/TSYURL.h"
+#include "Platform/base/FileDescriptor.h"
 
 class TSYFileManager {
  public:
@@ -57,6 +58,14 @@ class TSYFileManager {
   // A new, uniquely named directory in `parent`.
   TSYResult<TSYURL> createTemporaryDirectoryInDirectoryURL(const TSYURL& parent,
                                                            const std::string& prefix = "temp.");
+  // The same where others may write too, held open: what is done through the descriptor is done to
+  // the new directory and to nothing else.
+  struct OpenDirectory {
+    TSYURL url;
+    platform::FileDescriptor descriptor;
+  };
+  TSYResult<OpenDirectory> createOpenTemporaryDirectoryInDirectoryURL(const TSYURL& parent,
+                                                                      const std::string& prefix);
 
   // The items of a directory without those whose names begin with a dot. A missing directory fails
   // with ENOENT and without a log line.
@@ -64,6 +73,8 @@ class TSYFileManager {
 
   bool itemExistsAtURL(const TSYURL& url);
   bool itemDoesNotExistAtURL(const TSYURL& url);
+  // Whether a directory is there, with no link on the way. Fails (logged) when it cannot be told.
+  TSYResult<bool> directoryExistsAtURL(const TSYURL& url);
 
   TSYResult<int> dataProtectionClassOfItemAtURL(const TSYURL& url);
   // With a predicate the class changes only when it agrees to the current one.
@@ -87,6 +98,9 @@ class TSYFileManager {
   // The resolved form of `suspicious` when it stays inside `base`, which both may not exist in
   // full; none otherwise, with a log line that says why.
   std::optional<TSYURL> realPathForURL(const TSYURL& suspicious, const TSYURL& ifChildOfURL);
+
+  // realpath(3): every link followed, wherever it leads. Good for comparing only.
+  TSYResult<TSYURL> realPathOfItemAtURL(const TSYURL& url);
 
   // The home of an account, resolved; "/private/var/mobile" (below the root) when it has none.
   static TSYURL homeDirectoryURLForPOSIXUID(uid_t uid);

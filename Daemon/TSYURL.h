@@ -32,6 +32,11 @@ class TSYURL {
     const size_t slash = path_.rfind('/');
     return TSYURL(slash == 0 || slash == std::string::npos ? "/" : path_.substr(0, slash));
   }
+  // By the text alone: both must be free of dots and links for it to mean anything.
+  bool isInside(const TSYURL& directory) const {
+    return path_.starts_with(directory.path_) &&
+           std::string_view(path_).substr(directory.path_.size()).starts_with('/');
+  }
 
   bool operator==(const TSYURL&) const = default;
 

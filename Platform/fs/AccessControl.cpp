@@ -93,14 +93,19 @@ ACLResult<void> apply(const std::string& path, acl_type_t type, std::span<const 
 
 ACLResult<void> setACL(int parent, const std::string& name, ACLShape shape, gid_t group) {
   const FileDescriptor item(::openat(parent, name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
+  if (!item.valid()) return failed({});
+  return setACL(item.get(), shape, group);
+}
+
+ACLResult<void> setACL(int item, ACLShape shape, gid_t group) {
   struct stat status{};
-  if (!item.valid() || ::fstat(item.get(), &status) != 0) return failed({});
+  if (::fstat(item, &status) != 0) return failed({});
   const bool isFileShape = shape == ACLShape::file;
   if (S_ISLNK(status.st_mode)) return std::unexpected(ACLFailure{{}, Errno{ELOOP}, kNothing});
   if (S_ISDIR(status.st_mode) == isFileShape) {
     return std::unexpected(ACLFailure{{}, Errno{isFileShape ? EISDIR : ENOTDIR}, kNothing});
   }
-  const std::string path = linkToDescriptor(item.get());
+  const std::string path = linkToDescriptor(item);
   const bool isTopLevel = shape == ACLShape::topLevelDirectory;
   const auto access = isTopLevel ? std::span<const Entry>(kTopLevelAccess) : kInnerAccess;
   const auto applied = apply(path, ACL_TYPE_ACCESS, access, group);

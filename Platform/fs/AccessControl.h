@@ -30,6 +30,8 @@ using ACLResult = std::expected<T, ACLFailure>;
 // Sets the shape on the item (descriptor of its parent, name), which must not be a symbolic link.
 // libacl knows only paths: the item is reached through /proc/self/fd. Any thread.
 ACLResult<void> setACL(int parent, const std::string& name, ACLShape shape, gid_t group);
+// The same for an item that is open already; O_PATH will do.
+ACLResult<void> setACL(int item, ACLShape shape, gid_t group);
 
 // A directory made under a default ACL inherits its entries, but the mode of mkdir(2) or chmod(2)
 // narrows the mask that limits the named ones: mode 0 leaves nobody in. This widens the mask again

@@ -58,7 +58,14 @@ Result<void> FileSystem::setOwner(int descriptor, uid_t uid, gid_t gid) const {
   struct stat status{};
   if (::fstat(descriptor, &status) != 0) return lastErrno();
   if (status.st_uid == uid && status.st_gid == gid) return {};
-  return ownerChanged(::fchown(descriptor, uid, gid), privilege_);
+  return ownerChanged(::fchownat(descriptor, "", uid, gid, AT_EMPTY_PATH | AT_SYMLINK_NOFOLLOW),
+                      privilege_);
+}
+
+Result<void> FileSystem::setMode(int descriptor, mode_t mode) const {
+  const std::string itself = linkToDescriptor(descriptor);
+  if (::chmod(itself.c_str(), appliedMode(mode, privilege_)) != 0) return lastErrno();
+  return {};
 }
 
 Result<void> FileSystem::setOwnerAt(int parent, const std::string& name, uid_t uid,

@@ -110,6 +110,15 @@ class FileSystem {
   // A new directory of mode 0700 in `parent`, named `prefix` and six random characters.
   Result<std::string> makeTemporaryDirectory(const std::string& parent,
                                              const std::string& prefix) const;
+  // The same in a directory that somebody else may be changing, held open: what is done through the
+  // descriptor is done to the new directory, whatever stands at its name by then. ESTALE when
+  // something else stood there at once. No default ACL is applied beyond what mkdir(2) does.
+  struct NewDirectory {
+    std::string name;  // in the parent
+    FileDescriptor directory;
+  };
+  Result<NewDirectory> makeOpenTemporaryDirectory(const std::string& parent,
+                                                  const std::string& prefix) const;
 
   // --- Moving, copying, removing ----------------------------------------------------------------
   // rename(2). EXDEV across file systems and mounts.
@@ -127,8 +136,13 @@ class FileSystem {
   Result<void> remove(const std::string& path, const RemovalFailure& onFailure) const;
 
   // --- Attributes, on an open item --------------------------------------------------------------
-  // Changes only what differs.
+  // Opens (O_PATH) the item `name` of an open directory, a link itself. Fails with EMLINK for what
+  // is no directory and has another name too: it may be anybody's file. EAGAIN: it was changed just
+  // now, in the last few milliseconds, or is being changed, and this cannot be told yet.
+  Result<FileDescriptor> holdOnlyName(int parent, const std::string& name) const;
+  // Changes only what differs. For this and the next, an item open with O_PATH will do.
   Result<void> setOwner(int descriptor, uid_t uid, gid_t gid) const;
+  Result<void> setMode(int descriptor, mode_t mode) const;
   // The protection class of the item behind the descriptor. Unmarked: a directory 0, a file 3.
   Result<int> protectionClass(int descriptor) const;
   // EPERM for a regular file from or to class 1 while the device is locked.

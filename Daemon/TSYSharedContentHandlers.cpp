@@ -1,0 +1,55 @@
+// Commands for what clients keep or share inside containers.
+#include "Daemon/TSYCommandHandlers.h"
+#include "Daemon/TSYRequestResolvers.h"
+
+namespace {
+
+std::optional<std::string> stringUnder(const TSYRelayEvent& event, std::string_view key) {
+  const std::string* text = event.request.string(key);
+  return text == nullptr ? std::nullopt : std::optional(*text);
+}
+
+// The data container that the request means, which must be named.
+TSYResolved<TSYContainerIdentity> appDataContainerOf(const TSYRelayEvent& event,
+                                                     const TSYClientConnection& connection) {
+  const auto identifier =
+      TSYResolveIdentifier(event.request, connection, TSYIdentifierFallback::none);
+  if (!identifier) return std::unexpected(uint64_t{TSYErrorMissingIdentifier});
+  auto userIdentity =
+      TSYResolveUserIdentityForIdentifier(connection, *identifier, kTSYContainerClassAppData);
+  if (!userIdentity) return std::unexpected(userIdentity.error());
+  auto identity = TSYContainerIdentity::containerIdentityWithUserIdentity(
+      std::move(*userIdentity), *identifier, kTSYContainerClassAppData);
+  if (!identity) return std::unexpected(identity.error().clientCode());
+  return std::move(*identity);
+}
+
+}  // namespace
+
+uint64_t TSYHandleStageSharedContent(TSYRelayEvent& event, TSYClientConnection& connection) {
+  const auto staged = connection.stageSharedContentForIdentifier(
+      stringUnder(event, kTSYRequestIdentifier), stringUnder(event, "SourcePath"),
+      stringUnder(event, "DestPath"));
+  if (!staged) return staged.error().clientCode();
+  event.reply.set("ReplyPath", staged->path());
+  return TSYErrorSuccess;
+}
+
+uint64_t TSYHandleUserManagedAssetsPath(TSYRelayEvent& event, TSYClientConnection& connection) {
+  const auto identity = appDataContainerOf(event, connection);
+  if (!identity) return identity.error();
+  const auto assets = connection.userManagedAssetsPathWithContainerIdentity(
+      *identity, event.request.boolean("IsRelative").value_or(false),
+      event.request.boolean("CreateIfNecessary").value_or(false));
+  if (!assets) return assets.error().clientCode();
+  event.reply.set("ReplyPath", assets->path);
+  event.reply.set("ReplyExisted", assets->existed);
+  return TSYErrorSuccess;
+}
+
+uint64_t TSYHandleDeleteUserManagedAsset(TSYRelayEvent& event, TSYClientConnection& connection) {
+  const auto identity = appDataContainerOf(event, connection);
+  if (!identity) return identity.error();
+  return connection.deleteUserManagedAssetWithContainerIdentity(*identity,
+                                                                stringUnder(event, "SourcePath"));
+}
