@@ -78,8 +78,7 @@ TSYCodeSigningMapping::TSYCodeSigningMapping(TSYUserIdentityCache& userIdentityC
   });
 }
 
-// --- Entries
-// -----------------------------------------------------------------------------------------
+// --- Entries ------------------------------------------------------------------------------------
 
 TSYResult<TSYCodeSigningEntryRef> TSYCodeSigningMapping::codeSigningEntryForIdentifier(
     const std::string& identifier) {
@@ -133,8 +132,7 @@ bool TSYCodeSigningMapping::identifierHasCallerRegisteredEntitlements(
   return entry && *entry && (*entry)->registeredByCaller;
 }
 
-// --- Entitlements
-// ------------------------------------------------------------------------------------
+// --- Entitlements -------------------------------------------------------------------------------
 
 TSYCodeSigningMapping::Entitlements TSYCodeSigningMapping::_onQueue_entitlementsForIdentifier(
     const std::string& identifier) {
@@ -197,8 +195,7 @@ bool TSYCodeSigningMapping::identifierHasSystemContainer(const std::string& iden
   return _entitlementsHasSystemContainer(entitlementsForIdentifier(identifier));
 }
 
-// --- Parents and children
-// ----------------------------------------------------------------------------
+// --- Parents and children -----------------------------------------------------------------------
 
 TSYCodeSigningMapping::Identifiers TSYCodeSigningMapping::childBundleIdentifiersForParentIdentifier(
     const std::string& identifier) {
@@ -248,8 +245,7 @@ TSYResult<std::vector<std::string>> TSYCodeSigningMapping::identifiers() {
   });
 }
 
-// --- Invalidation
-// ------------------------------------------------------------------------------------
+// --- Invalidation -------------------------------------------------------------------------------
 
 TSYResult<void> TSYCodeSigningMapping::invalidateCodeSigningInfoForIdentifier(
     const std::string& identifier) {
@@ -338,8 +334,7 @@ TSYResult<void> TSYCodeSigningMapping::invalidateUnlessBundled(const std::string
                                    invalidated.error()));
 }
 
-// --- After an update of the system
-// -------------------------------------------------------------------
+// --- After an update of the system --------------------------------------------------------------
 
 // The removals go on a queue of their own, which runs before the lock is let go: between the
 // counting of references and the removal nobody can create or look up a container.

@@ -146,8 +146,7 @@ void TSYSQLiteDB::closeDB() {
   db_ = nullptr;
 }
 
-// --- Statements and transactions
-// -------------------------------------------------------------------
+// --- Statements and transactions ----------------------------------------------------------------
 
 TSYResult<TSYSQLiteStatement> TSYSQLiteDB::prepare(Query query) {
   sqlite3_stmt*& kept = statements_[static_cast<size_t>(query)];
@@ -242,8 +241,7 @@ TSYResult<void> TSYSQLiteDB::_performSingleParameterQuery(Query query, const std
   return _performTwoParameterQuery(query, one, /*two=*/nullptr, expectedChanges);
 }
 
-// --- Adding
-// ----------------------------------------------------------------------------------------
+// --- Adding -------------------------------------------------------------------------------------
 
 TSYResult<void> TSYSQLiteDB::addCodeSigningEntry(const TSYCodeSigningEntry& entry,
                                                  const std::string& identifier) {
@@ -359,8 +357,7 @@ TSYResult<void> TSYSQLiteDB::_insertCodeSigningData(const TSYCodeSigningEntry& e
   return stepToEnd(*statement);
 }
 
-// --- Deleting and invalidating
-// ---------------------------------------------------------------------
+// --- Deleting and invalidating ------------------------------------------------------------------
 
 TSYResult<void> TSYSQLiteDB::deleteCodeSigningEntryWithIdentifier(const std::string& identifier) {
   auto deleted = _deleteCodeSigningWithIdentifier(identifier);

@@ -1,7 +1,8 @@
 #!/usr/bin/env bash
 # The main job, from nothing, on a scratch root: the daemon is started, creates containers for two
-# applications of one user, for an enterprise persona, a group and a system container; they are
-# found again after a restart; a client without rights is refused. Everything is removed at the end.
+# applications of one user, for an enterprise persona, a group and a system container; an
+# application is registered with its groups and removed with them; what stays is found again after a
+# restart; a client without rights is refused. Everything is removed at the end.
 #
 # TESSARY_BUILD names the build directory.
 set -euo pipefail
@@ -39,6 +40,12 @@ start_daemon() {
 }
 
 title() { printf '\n== %s\n' "$*"; }
+
+# tessaryctl with every right
+control() {
+  echo "\$ root: tessaryctl $*"
+  "$build/tessaryctl" --root "$root" "$@"
+}
 
 # as IDENTIFIER [OPTIONS of run] -- ARGUMENTS of tessaryctl
 as() {
@@ -103,8 +110,24 @@ as com.example.notes --entitlements "$entitlements" -- create --class 7 group.co
 title "a well-known system container, under its own name"
 as com.example.notes -- system-path com.veltra.exampled
 
+title "the installer registers an application with two groups; each gets a container"
+cat >"$root/office.plist" <<'END'
+<?xml version="1.0" encoding="UTF-8"?>
+<plist version="1.0"><dict>
+  <key>com.veltra.security.application-groups</key>
+  <array><string>group.com.example.office</string><string>group.com.example.drafts</string></array>
+</dict></plist>
+END
+control register com.example.office --entitlements "$root/office.plist" --class 2
+control create --class 1 com.example.office
+control groups com.example.office
+
 title "what is on the disk"
 show_tree
+
+title "the application goes: what was registered for it goes too, and with it the group containers"
+control delete --class 1 com.example.office
+control groups com.example.office
 
 title "a client without rights asks for another's container"
 if as com.example.spy -- lookup --class 2 com.example.photos; then
@@ -117,8 +140,7 @@ stop_daemon
 start_daemon
 as com.example.notes -- lookup --class 2
 as com.example.office --persona WORK -- lookup --class 2
-echo "\$ root: tessaryctl list --class 2"
-"$build/tessaryctl" --root "$root" list --class 2
+control list --class 2
 
 stop_daemon
 title "done; the scratch root is removed"

@@ -9,6 +9,8 @@
 #include <new>
 
 #include "Daemon/TSYClientConnection.h"
+#include "Daemon/TSYCodeSigningMapping.h"
+#include "Daemon/TSYException.h"
 #include "Tests/Daemon/ContainerDevice.h"
 
 namespace {
@@ -70,6 +72,42 @@ TEST(TSYClientConnection, anExceptionBecomesAnErrorWhereverItIsThrown) {
   for (const std::string& name : device.namesIn(live)) {
     EXPECT_EQ(device.namesIn(live + name).size(), 5U) << "half-built: " << name;
   }
+}
+
+// A registration that an allocation ends is done or not, and nothing is stuck: no transaction, no
+// statement, no queue.
+TEST(TSYCodeSigningMapping, anExceptionLeavesTheDatabaseUsable) {
+  const ContainerDevice device(std::nullopt, {}, TSYLogLevelError);
+  TSYCodeSigningMapping& mapping = TSYCodeSigningMapping::sharedInstance();
+  TSYCommandQueue queue;
+  const auto infoOf = [](int version) {
+    return std::make_shared<const platform::Value::Dictionary>(
+        platform::Value::Dictionary{{"version", version}});
+  };
+  const auto put = [&](const TSYCodeSigningMapping::Info& info, int allocations) {
+    const std::string identifier = "com.example.app";
+    const platform::Value::Dictionary options{{"com.veltra.Tessary.ParentBundleID", "parent"}};
+    allocationsBeforeFailure = allocations;
+    auto done = TSYCatchingExceptions([&]() -> TSYResult<uint64_t> {
+      return mapping.processCodeSigningInfo(info, identifier, options, queue);
+    });
+    allocationsBeforeFailure = -1;
+    return done ? *done : done.error().code();
+  };
+  ASSERT_EQ(mapping.processCodeSigningInfo(infoOf(0), "parent", {}, queue), 1U);
+  ASSERT_EQ(put(infoOf(-1), -1), 1U);
+  int failures = 0;
+  for (int allocations = 0;; ++allocations) {
+    const auto info = infoOf(allocations);
+    const uint64_t code = put(info, allocations);
+    if (code == TSYErrorException) ++failures;
+    const auto entry = mapping.codeSigningEntryForIdentifier("com.example.app");
+    ASSERT_TRUE(entry.has_value()) << allocations;
+    if (code == TSYErrorSuccess && *(*entry)->codeSigningInfo == *info) break;
+    ASSERT_EQ(put(infoOf(-1), -1), 1U) << allocations;
+    ASSERT_EQ(mapping.parentIdentifierForChildIdentifier("com.example.app"), "parent");
+  }
+  EXPECT_GT(failures, 10);
 }
 
 }  // namespace

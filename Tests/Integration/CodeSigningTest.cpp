@@ -151,8 +151,7 @@ TEST_F(CodeSigning, TheLifeOfAnApplication) {
   EXPECT_THAT(groupsOnDisk(workAgain), IsEmpty());
 }
 
-// --- Crashes
-// -----------------------------------------------------------------------------------------
+// --- Crashes ------------------------------------------------------------------------------------
 
 std::string integrityOf(const std::string& path) {
   sqlite3* db = nullptr;
@@ -257,8 +256,7 @@ TEST_F(CodeSigning, ADatabaseThatCannotBeUsedEndsTheStart) {
   EXPECT_EQ(integrityOf(database), "ok");
 }
 
-// --- Strange information
-// -----------------------------------------------------------------------------
+// --- Strange information ------------------------------------------------------------------------
 
 TEST_F(CodeSigning, StrangeInformationStaysInItsPlace) {
   device_->start();
