@@ -8,6 +8,7 @@
 #include <memory>
 
 #include "Daemon/Startup.h"
+#include "Daemon/TSYCodeSigningMapping.h"
 #include "Daemon/TSYDispatcher.h"
 #include "Daemon/TSYLog.h"
 #include "Platform/ipc/server/Server.h"
@@ -95,7 +96,10 @@ int TSYRunDaemon() {
       [starting = std::move(starting), server = server.get()] { beginService(server); });
   platform.runLoop.run();
 
-  if (endService(server.get())) return EXIT_SUCCESS;
+  if (endService(server.get())) {
+    TSYCodeSigningMapping::sharedInstance().close();
+    return EXIT_SUCCESS;
+  }
   TSYLogWrite(TSYLogLevelError, "Ending with work in hand after {} seconds: {}",
               kPatienceAtTheEnd.count(), fmt::join(platform.keepAlive.openTransactions(), ", "));
   std::_Exit(EXIT_FAILURE);

@@ -97,6 +97,12 @@ TSYResult<std::string> createAssets(TSYMetadata container) {
   if (auto written = container.writeMetadataToDisk(); !written) {
     return TSYFailure(std::move(written.error()));
   }
+  // What a client keeps there must not be forgotten with the record.
+  for (const TSYURL& made : {libraryOf(container).appending(*name), container.metadataFileURL()}) {
+    if (auto synced = fileManager().syncDirectoryOfItemAtURL(made); !synced) {
+      return TSYFailure(std::move(synced.error()));
+    }
+  }
   auto added = TSYAddToCache(container, container.url(), container.transient(),
                              /*updateSandbox=*/false);
   if (!added) return TSYFailure(std::move(added.error()));
@@ -105,29 +111,30 @@ TSYResult<std::string> createAssets(TSYMetadata container) {
 
 // The real path of the item that `relativePath` names in the assets directory.
 TSYResult<TSYURL> assetToDelete(const TSYURL& directory, const std::string& relativePath) {
-  const auto invalid = [](const TSYURL& resource, const std::optional<TSYError>& error) {
+  const auto unresolvable = [](const TSYURL& resource, const TSYError& error) {
     return TSYFailure(TSYErrorCreate(TSYErrorInvalidPath, error, TSYLogIt::yes,
                                      "Unable to get realpath for resource {}", resource.path()));
   };
   const auto realDirectory = fileManager().realPathOfItemAtURL(directory);
-  if (!realDirectory) return invalid(directory, realDirectory.error());
+  if (!realDirectory) return unresolvable(directory, realDirectory.error());
+  const auto outside = [&] {
+    return TSYFailure(TSYErrorCreate(TSYErrorInvalidPath, std::nullopt, TSYLogIt::yes,
+                                     "Illegal attempt to delete asset not residing in user managed "
+                                     "assets directory {}",
+                                     directory.path()));
+  };
   // With a link on the way it is no assets directory, and may be anybody's.
-  if (*realDirectory != directory) return invalid(directory, std::nullopt);
+  if (*realDirectory != directory) return outside();
   const TSYURL asset = directory.appending(relativePath);
   auto realAsset = fileManager().realPathOfItemAtURL(asset);
-  if (!realAsset) return invalid(asset, realAsset.error());
+  if (!realAsset) return unresolvable(asset, realAsset.error());
   if (*realAsset == *realDirectory) {
     return TSYFailure(TSYErrorCreate(TSYErrorInvalidPath, std::nullopt, TSYLogIt::yes,
                                      "Illegal attempt to delete user managed assets directory at "
                                      "{}",
                                      realAsset->path()));
   }
-  if (!realAsset->isInside(*realDirectory)) {
-    return TSYFailure(TSYErrorCreate(TSYErrorInvalidPath, std::nullopt, TSYLogIt::yes,
-                                     "Illegal attempt to delete asset not residing in user managed "
-                                     "assets directory {}",
-                                     realAsset->path()));
-  }
+  if (!realAsset->isInside(*realDirectory)) return outside();
   return realAsset;
 }
 

@@ -66,7 +66,7 @@ TSYResult<TSYURL> stage(const TSYMetadata& container, const std::string& sourceR
                                      container.identifier(), source->path(), dest->path(),
                                      moved.error()));
   }
-  return *dest;
+  return destURL;
 }
 
 }  // namespace

@@ -154,7 +154,8 @@ class TSYClientConnection {
   };
   // The directory in which a client keeps content that its user manages, absolute or relative to
   // the container. Codes 38 for another's container without the entitlement, 11, 71 (not logged)
-  // when there is none and none is to be made, 6, 45, 40 and those of the metadata file.
+  // when there is none and none is to be made, 41 when that cannot be told, 6, 45, 40 and those of
+  // the metadata file.
   TSYResult<UserManagedAssets> userManagedAssetsPathWithContainerIdentity(
       const TSYContainerIdentity& identity, bool isRelative, bool createIfNecessary);
   // Moves one item of that directory to death row. `relativePath` is relative to it. Codes 11, 10

@@ -78,6 +78,14 @@ TSYCodeSigningMapping::TSYCodeSigningMapping(TSYUserIdentityCache& userIdentityC
   });
 }
 
+void TSYCodeSigningMapping::close() {
+  onQueue([&] {
+    queue_.assertCurrent();
+    codeSigningMappingDB_->closeDB();
+    queue_.suspend();
+  });
+}
+
 // --- Entries ------------------------------------------------------------------------------------
 
 TSYResult<TSYCodeSigningEntryRef> TSYCodeSigningMapping::codeSigningEntryForIdentifier(

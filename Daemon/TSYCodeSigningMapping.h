@@ -103,6 +103,10 @@ class TSYCodeSigningMapping {
   // must not be taken for one without.
   std::optional<ReferenceCounts> copyReferenceCountSetOfType(TSYGroupType type);
 
+  // The end of the process: closes the database, whose file is whole by itself then. Nothing runs
+  // on the queue any more, and who asks waits.
+  void close();
+
   // Whether the calling thread is on the queue.
   bool isOnQueue() const { return queue_.isCurrent(); }
 

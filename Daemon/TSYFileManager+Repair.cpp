@@ -102,7 +102,8 @@ TSYResult<gid_t> systemUsersGroup() {
 //
 // Many may write into one, and change names while it is repaired. So each item is held, and all
 // three are done to what is held. A file that has another name as well may be somebody else's that
-// was linked here to be opened to all: it is left alone.
+// was linked here to be opened to all: it is left alone. What was moved here is taken for what is
+// meant to be here.
 class ACLRepair {
  public:
   ACLRepair(bool isSystemContainer, gid_t group)
@@ -155,7 +156,7 @@ class ACLRepair {
   // things is not waited for without end.
   platform::Result<platform::FileDescriptor> hold(int parent, const std::string& name) {
     constexpr int kWaitsForOne = 8;
-    constexpr int kWaitsForAll = 512;
+    constexpr int kWaitsForAll = 64;
     constexpr std::chrono::milliseconds kWait{2};
     for (int wait = 0;; ++wait) {
       auto item = files().holdOnlyName(parent, name);

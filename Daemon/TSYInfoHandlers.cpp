@@ -7,10 +7,7 @@ using platform::Value;
 
 namespace {
 
-std::optional<std::string> keyOf(const TSYRelayEvent& event) {
-  const std::string* key = event.request.string("Key");
-  return key == nullptr ? std::nullopt : std::optional(*key);
-}
+constexpr char kKey[] = "Key";
 
 uint64_t codeOf(const TSYResult<void>& result) {
   return result ? uint64_t{TSYErrorSuccess} : result.error().clientCode();
@@ -26,13 +23,15 @@ uint64_t TSYHandleSetInfoValue(TSYRelayEvent& event, TSYClientConnection& connec
     if (!TSYHasPropertyListForm(*given)) return TSYErrorInvalidArgument;
     value = *given;
   }
-  return codeOf(connection.setInfoValue(value, keyOf(event), *identity, /*useLocking=*/true));
+  return codeOf(connection.setInfoValue(value, TSYStringUnder(event.request, kKey), *identity,
+                                        /*useLocking=*/true));
 }
 
 uint64_t TSYHandleGetInfoValue(TSYRelayEvent& event, TSYClientConnection& connection) {
   const auto identity = TSYResolveConcreteContainerIdentity(event.request, connection);
   if (!identity) return identity.error();
-  auto value = connection.infoValueForKey(keyOf(event), *identity, /*useLocking=*/true);
+  auto value = connection.infoValueForKey(TSYStringUnder(event.request, kKey), *identity,
+                                          /*useLocking=*/true);
   if (!value) return value.error().clientCode();
   event.reply.set("ReplyInfoValue", std::move(*value));
   return TSYErrorSuccess;

@@ -11,11 +11,6 @@ using platform::ipc::Message;
 
 namespace {
 
-std::optional<std::string> stringUnder(const Message& request, std::string_view key) {
-  const std::string* value = request.string(key);
-  return value == nullptr ? std::nullopt : std::optional(*value);
-}
-
 std::optional<platform::UUID> uuidUnder(const Message& request, std::string_view key) {
   const platform::UUID* value = request.uuid(key);
   return value == nullptr ? std::nullopt : std::optional(*value);
@@ -76,13 +71,13 @@ struct NamedContainer {
 TSYResolved<NamedContainer> resolveNamed(const Message& request,
                                          const TSYClientConnection& connection,
                                          const TSYConcreteKeys& keys) {
-  auto identifier = stringUnder(request, keys.identifier);
+  auto identifier = TSYStringUnder(request, keys.identifier);
   if (!identifier) return std::unexpected(uint64_t{TSYErrorMissingIdentifier});
   const auto containerClass = resolveClass(request, keys.containerClass);
   if (!containerClass) return std::unexpected(containerClass.error());
   NamedContainer named{std::move(*identifier), *containerClass, connection.clientUserIdentity()};
   if (TSYUserIdentity::isUserIdentityRequiredForContainerClass(*containerClass)) {
-    auto persona = TSYResolvePersona(connection, stringUnder(request, keys.persona));
+    auto persona = TSYResolvePersona(connection, TSYStringUnder(request, keys.persona));
     if (!persona) return std::unexpected(persona.error());
     named.userIdentity = std::move(*persona);
   }
@@ -106,10 +101,15 @@ const char* extensionClassFor(TSYContainerClass containerClass) {
 
 }  // namespace
 
+std::optional<std::string> TSYStringUnder(const Message& request, std::string_view key) {
+  const std::string* value = request.string(key);
+  return value == nullptr ? std::nullopt : std::optional(*value);
+}
+
 std::optional<std::string> TSYResolveIdentifier(const Message& request,
                                                 const TSYClientConnection& connection,
                                                 TSYIdentifierFallback fallback) {
-  if (auto identifier = stringUnder(request, kTSYRequestIdentifier)) return identifier;
+  if (auto identifier = TSYStringUnder(request, kTSYRequestIdentifier)) return identifier;
   if (fallback == TSYIdentifierFallback::none || !connection.clientIdentity()) return std::nullopt;
   return connection.clientBundleIdentifier();
 }

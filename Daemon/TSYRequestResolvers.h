@@ -21,6 +21,10 @@ inline constexpr char kTSYRequestContainerClass[] = "ContainerClass";
 inline constexpr char kTSYRequestUUID[] = "UUID";
 inline constexpr char kTSYRequestPersonaUniqueString[] = "PersonaUniqueString";
 
+// The string under a key; none for what is no string.
+std::optional<std::string> TSYStringUnder(const platform::ipc::Message& request,
+                                          std::string_view key);
+
 // Whether the client's own identifier stands in for one that the request does not carry.
 enum class TSYIdentifierFallback { none, client };
 

@@ -44,7 +44,7 @@ TSYResult<TSYCodeSigningEntry> TSYSQLiteDB::codeSigningEntryWithIdentifier(
 
 TSYResult<TSYCodeSigningEntry> TSYSQLiteDB::_selectCodeSigningEntryWithIdentifier(
     const std::string& identifier) {
-  auto row = prepareWithIdentifier(Query::selectEntry, identifier);
+  auto row = prepareWithIdentifier(TSYSQLiteQuery::selectEntry, identifier);
   if (!row) return TSYFailure(std::move(row.error()));
   switch (row->step()) {
     case SQLITE_ROW:
@@ -109,7 +109,7 @@ TSYResult<void> TSYSQLiteDB::forEachText(TSYSQLiteStatement& rows, const TextBlo
 
 TSYResult<std::vector<std::string>> TSYSQLiteDB::childIdentifiersForParentIdentifier(
     const std::string& parent) {
-  auto rows = prepareWithIdentifier(Query::selectChildren, parent);
+  auto rows = prepareWithIdentifier(TSYSQLiteQuery::selectChildren, parent);
   if (!rows) return TSYFailure(std::move(rows.error()));
   std::vector<std::string> children;
   auto read = forEachText(*rows, [&](const char* text) -> TSYResult<void> {
@@ -129,7 +129,7 @@ TSYResult<std::vector<std::string>> TSYSQLiteDB::childIdentifiersForParentIdenti
 }
 
 TSYResult<std::string> TSYSQLiteDB::parentIdentifierForChildIdentifier(const std::string& child) {
-  auto rows = prepareWithIdentifier(Query::selectParent, child);
+  auto rows = prepareWithIdentifier(TSYSQLiteQuery::selectParent, child);
   if (!rows) return TSYFailure(std::move(rows.error()));
   std::optional<std::string> parent;
   auto read = forEachText(*rows, [&](const char* text) -> TSYResult<void> {
@@ -148,7 +148,7 @@ TSYResult<std::string> TSYSQLiteDB::parentIdentifierForChildIdentifier(const std
 }
 
 TSYResult<std::vector<std::string>> TSYSQLiteDB::identifiers() {
-  auto rows = prepare(Query::selectIdentifiers);
+  auto rows = prepare(TSYSQLiteQuery::selectIdentifiers);
   if (!rows) return TSYFailure(std::move(rows.error()));
   std::vector<std::string> identifiers;
   auto read = forEachText(*rows, [&](const char* text) -> TSYResult<void> {
@@ -169,7 +169,7 @@ TSYResult<std::vector<std::string>> TSYSQLiteDB::identifiers() {
 
 TSYResult<void> TSYSQLiteDB::enumerateIdentifiersAndCodeSigningInfoUsingBlock(
     const EntryBlock& block) {
-  auto rows = prepare(Query::selectAll);
+  auto rows = prepare(TSYSQLiteQuery::selectAll);
   if (!rows) return TSYFailure(std::move(rows.error()));
   TSYResult<void> result;
   for (;;) {

@@ -15,27 +15,6 @@ namespace {
 
 constexpr char kFileName[] = "containers.sqlite3";
 
-// How the file is used, and what it holds. A data row and the rows of children go with their entry.
-constexpr char kSchema[] =
-    "PRAGMA locking_mode = EXCLUSIVE;"
-    "PRAGMA journal_mode = WAL;"
-    "PRAGMA foreign_keys = ON;"
-    "PRAGMA auto_vacuum = FULL;"
-    "CREATE TABLE IF NOT EXISTS code_signing_info(id INTEGER PRIMARY KEY AUTOINCREMENT,"
-    "code_signing_id_text TEXT NOT NULL UNIQUE,invalid INTEGER NOT NULL DEFAULT 0,"
-    "placeholder INTEGER NOT NULL DEFAULT 0,registered_by_caller INTEGER NOT NULL DEFAULT 0,"
-    "data_container_class INTEGER NOT NULL DEFAULT 0);"
-    "CREATE TABLE IF NOT EXISTS code_signing_data(id INTEGER PRIMARY KEY AUTOINCREMENT,"
-    "cs_info_id INTEGER NOT NULL UNIQUE,data BLOB NOT NULL,"
-    "FOREIGN KEY(cs_info_id) REFERENCES code_signing_info(id) ON DELETE CASCADE);"
-    "CREATE TABLE IF NOT EXISTS child_bundles(id INTEGER PRIMARY KEY AUTOINCREMENT,"
-    "child_code_signing_id_text TEXT NOT NULL UNIQUE,parent_id INTEGER NOT NULL,"
-    "FOREIGN KEY(parent_id) REFERENCES code_signing_info(id) ON DELETE CASCADE);"
-    "CREATE INDEX IF NOT EXISTS code_signing_id_text_idx ON "
-    "code_signing_info(code_signing_id_text);"
-    "CREATE INDEX IF NOT EXISTS cs_info_id_idx ON code_signing_data(cs_info_id);"
-    "CREATE INDEX IF NOT EXISTS parent_id_idx ON child_bundles(parent_id);";
-
 FileDescriptor openDirectory(const TSYURL& url) {
   auto directory = platform::Platform::current().files.openDirectory(url.path());
   return directory ? std::move(*directory) : FileDescriptor();
@@ -61,42 +40,6 @@ int withoutHigherBits(uint64_t number) {
 
 }  // namespace
 
-const std::array<TSYSQLiteDB::QueryText, TSYSQLiteDB::kQueryCount> TSYSQLiteDB::kQueries = {{
-    {"UPDATE code_signing_info SET invalid=?, placeholder=?, registered_by_caller=?, "
-     "data_container_class=? WHERE code_signing_id_text=?;",
-     "insert"},
-    {"INSERT INTO code_signing_info (invalid, placeholder, registered_by_caller, "
-     "data_container_class, code_signing_id_text) VALUES (?, ?, ?, ?, ?);",
-     "insert"},
-    {"INSERT OR REPLACE INTO code_signing_data (cs_info_id, data) SELECT id, ? FROM "
-     "code_signing_info WHERE code_signing_id_text = ?;",
-     "insert"},
-    {"INSERT OR REPLACE INTO child_bundles (parent_id, child_code_signing_id_text) SELECT id, ? "
-     "FROM code_signing_info WHERE code_signing_id_text = ?;",
-     "insert"},
-    {"DELETE FROM code_signing_info WHERE code_signing_id_text=?;", "insert"},
-    {"UPDATE code_signing_info SET invalid=1 WHERE code_signing_id_text = ?;", "insert"},
-    {"SELECT code_signing_data.data, code_signing_info.invalid, code_signing_info.placeholder, "
-     "code_signing_info.registered_by_caller, code_signing_info.data_container_class FROM "
-     "code_signing_info, code_signing_data WHERE code_signing_info.id = "
-     "code_signing_data.cs_info_id AND code_signing_info.code_signing_id_text = ?;",
-     "select"},
-    {"SELECT code_signing_data.data, code_signing_info.invalid, code_signing_info.placeholder, "
-     "code_signing_info.registered_by_caller, code_signing_info.data_container_class, "
-     "code_signing_info.code_signing_id_text FROM code_signing_info, code_signing_data WHERE "
-     "code_signing_info.id = code_signing_data.cs_info_id;",
-     "select"},
-    {"SELECT code_signing_info.code_signing_id_text FROM code_signing_info;", "select"},
-    {"SELECT child_bundles.child_code_signing_id_text FROM child_bundles, code_signing_info WHERE "
-     "code_signing_info.code_signing_id_text = ? AND child_bundles.parent_id=code_signing_info.id;",
-     "select"},
-    {"SELECT code_signing_info.code_signing_id_text FROM child_bundles, code_signing_info WHERE "
-     "child_bundles.child_code_signing_id_text = ? AND "
-     "child_bundles.parent_id=code_signing_info.id;",
-     "select"},
-    {"DELETE FROM code_signing_info WHERE (placeholder & ?) > 0;", "delete"},
-}};
-
 TSYSQLiteDB::TSYSQLiteDB(const TSYURL& parentDirectory)
     : url_(parentDirectory.appending(kFileName)),
       directory_(openDirectory(parentDirectory)),
@@ -117,7 +60,7 @@ sqlite3* TSYSQLiteDB::openDBWithURL(const TSYURL& url) const {
     TSYStopProcess(TSYChannel::database, fmt::format("Failed to open database, err = {}", opened));
   }
   char* message = nullptr;
-  const int prepared = sqlite3_exec(db, kSchema, nullptr, nullptr, &message);
+  const int prepared = sqlite3_exec(db, kTSYSQLiteSchema, nullptr, nullptr, &message);
   if (prepared != SQLITE_OK) {
     TSYLogWrite(TSYLogLevelError, "table create for {} failed: {}", url.path(),
                 message == nullptr ? sqlite3_errstr(prepared) : message);
@@ -148,14 +91,14 @@ void TSYSQLiteDB::closeDB() {
 
 // --- Statements and transactions ----------------------------------------------------------------
 
-TSYResult<TSYSQLiteStatement> TSYSQLiteDB::prepare(Query query) {
+TSYResult<TSYSQLiteStatement> TSYSQLiteDB::prepare(TSYSQLiteQuery query) {
   sqlite3_stmt*& kept = statements_[static_cast<size_t>(query)];
   if (kept != nullptr) {
     TSY_INVARIANT(sqlite3_stmt_busy(kept) == 0);
     return TSYSQLiteStatement(kept);
   }
   constexpr int kToItsEnd = -1;
-  const QueryText& text = textOf(query);
+  const TSYSQLiteQueryText& text = TSYSQLiteTextOf(query);
   if (sqlite3_prepare_v3(db_, text.sql, kToItsEnd, SQLITE_PREPARE_PERSISTENT, &kept, nullptr) !=
       SQLITE_OK) {
     return TSYFailure(TSYErrorCreate(TSYErrorDatabase, std::nullopt, TSYLogIt::yes,
@@ -165,7 +108,7 @@ TSYResult<TSYSQLiteStatement> TSYSQLiteDB::prepare(Query query) {
   return TSYSQLiteStatement(kept);
 }
 
-TSYResult<TSYSQLiteStatement> TSYSQLiteDB::prepareWithIdentifier(Query query,
+TSYResult<TSYSQLiteStatement> TSYSQLiteDB::prepareWithIdentifier(TSYSQLiteQuery query,
                                                                  const std::string& identifier) {
   auto statement = prepare(query);
   if (statement && !statement->bind(1, identifier)) return TSYFailure(bindFailure(identifier));
@@ -222,7 +165,7 @@ TSYResult<void> TSYSQLiteDB::rollBack(TSYError cause) {
                                    "failed _sqliteExec rollback"));
 }
 
-TSYResult<void> TSYSQLiteDB::_performTwoParameterQuery(Query query, const std::string& one,
+TSYResult<void> TSYSQLiteDB::_performTwoParameterQuery(TSYSQLiteQuery query, const std::string& one,
                                                        const std::string* two,
                                                        int expectedChanges) {
   auto statement = prepareWithIdentifier(query, one);
@@ -233,10 +176,12 @@ TSYResult<void> TSYSQLiteDB::_performTwoParameterQuery(Query query, const std::s
   if (expectedChanges == kAnyChanges || changes == expectedChanges) return {};
   return TSYFailure(TSYErrorCreate(TSYErrorDatabaseChangeCount, std::nullopt, TSYLogIt::no,
                                    "sqlite3_changes for {} in {}: {}, but expecting {}",
-                                   textOf(query).sql, url_.path(), changes, expectedChanges));
+                                   TSYSQLiteTextOf(query).sql, url_.path(), changes,
+                                   expectedChanges));
 }
 
-TSYResult<void> TSYSQLiteDB::_performSingleParameterQuery(Query query, const std::string& one,
+TSYResult<void> TSYSQLiteDB::_performSingleParameterQuery(TSYSQLiteQuery query,
+                                                          const std::string& one,
                                                           int expectedChanges) {
   return _performTwoParameterQuery(query, one, /*two=*/nullptr, expectedChanges);
 }
@@ -263,19 +208,19 @@ TSYResult<void> TSYSQLiteDB::addCodeSigningEntry(const TSYCodeSigningEntry& entr
 
 TSYResult<void> TSYSQLiteDB::_insertChildIdentifier(const std::string& child,
                                                     const std::string& parent) {
-  return _performTwoParameterQuery(Query::insertChild, child, &parent, kAnyChanges);
+  return _performTwoParameterQuery(TSYSQLiteQuery::insertChild, child, &parent, kAnyChanges);
 }
 
 TSYResult<void> TSYSQLiteDB::_insertCodeSigningInfo(const TSYCodeSigningEntry& entry,
                                                     const std::string& identifier) {
-  auto updated = _performInsertOrUpdateQuery(Query::updateEntry, entry, identifier,
+  auto updated = _performInsertOrUpdateQuery(TSYSQLiteQuery::updateEntry, entry, identifier,
                                              /*isUpdate=*/true);
   if (updated) return {};
   if (!updated.error().is(TSYErrorDatabaseChangeCount)) {
     return TSYFailure(TSYErrorCreate(TSYErrorDatabase, updated.error(), TSYLogIt::yes,
                                      "Error performing UPDATE operation for {}", identifier));
   }
-  auto inserted = _performInsertOrUpdateQuery(Query::insertEntry, entry, identifier,
+  auto inserted = _performInsertOrUpdateQuery(TSYSQLiteQuery::insertEntry, entry, identifier,
                                               /*isUpdate=*/false);
   if (inserted) return {};
   return TSYFailure(TSYErrorCreate(TSYErrorDatabase, inserted.error(), TSYLogIt::yes,
@@ -317,7 +262,7 @@ TSYResult<void> TSYSQLiteDB::bindEntry(TSYSQLiteStatement& statement,
   return {};
 }
 
-TSYResult<void> TSYSQLiteDB::_performInsertOrUpdateQuery(Query query,
+TSYResult<void> TSYSQLiteDB::_performInsertOrUpdateQuery(TSYSQLiteQuery query,
                                                          const TSYCodeSigningEntry& entry,
                                                          const std::string& identifier,
                                                          bool isUpdate) {
@@ -329,7 +274,7 @@ TSYResult<void> TSYSQLiteDB::_performInsertOrUpdateQuery(Query query,
   if (!isUpdate || changes == 1) return {};
   return TSYFailure(TSYErrorCreate(TSYErrorDatabaseChangeCount, std::nullopt, TSYLogIt::no,
                                    "sqlite3_changes for {} in {}: {}, but expecting 1",
-                                   textOf(query).sql, url_.path(), changes));
+                                   TSYSQLiteTextOf(query).sql, url_.path(), changes));
 }
 
 TSYResult<void> TSYSQLiteDB::_insertCodeSigningData(const TSYCodeSigningEntry& entry,
@@ -341,7 +286,7 @@ TSYResult<void> TSYSQLiteDB::_insertCodeSigningData(const TSYCodeSigningEntry& e
                                      "Error serializing code signing info for {}: {}", identifier,
                                      data.error().reason));
   }
-  auto statement = prepare(Query::insertData);
+  auto statement = prepare(TSYSQLiteQuery::insertData);
   if (!statement) return TSYFailure(std::move(statement.error()));
   if (!statement->bind(1, std::span<const uint8_t>(*data))) {
     return TSYFailure(TSYErrorCreate(TSYErrorDatabase, std::nullopt, TSYLogIt::yes,
@@ -367,11 +312,12 @@ TSYResult<void> TSYSQLiteDB::deleteCodeSigningEntryWithIdentifier(const std::str
 }
 
 TSYResult<void> TSYSQLiteDB::_deleteCodeSigningWithIdentifier(const std::string& identifier) {
-  return _performSingleParameterQuery(Query::deleteEntry, identifier, /*expectedChanges=*/1);
+  return _performSingleParameterQuery(TSYSQLiteQuery::deleteEntry, identifier,
+                                      /*expectedChanges=*/1);
 }
 
 TSYResult<void> TSYSQLiteDB::invalidateCodeSigningWithIdentifier(const std::string& identifier) {
-  auto invalidated = _performSingleParameterQuery(Query::invalidateEntry, identifier);
+  auto invalidated = _performSingleParameterQuery(TSYSQLiteQuery::invalidateEntry, identifier);
   if (invalidated) return {};
   return TSYFailure(TSYErrorCreate(TSYErrorDatabase, invalidated.error(), TSYLogIt::yes,
                                    "failed to invalidate identifier {}", identifier));
@@ -403,7 +349,7 @@ TSYResult<void> TSYSQLiteDB::invalidateCodeSigningForIdentifierAndAllChildren(
 }
 
 TSYResult<void> TSYSQLiteDB::deleteAllAdvanceCopiesOfCodeSigningEntries() {
-  auto statement = prepare(Query::deleteAdvanceCopies);
+  auto statement = prepare(TSYSQLiteQuery::deleteAdvanceCopies);
   if (!statement) return TSYFailure(std::move(statement.error()));
   if (!statement->bind(1, kAdvanceCopyFlag)) {
     return TSYFailure(TSYErrorCreate(TSYErrorDatabase, std::nullopt, TSYLogIt::yes,

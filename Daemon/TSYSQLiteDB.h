@@ -17,6 +17,7 @@
 
 #include "Daemon/TSYCodeSigningEntry.h"
 #include "Daemon/TSYError.h"
+#include "Daemon/TSYSQLiteQueries.h"
 #include "Daemon/TSYSQLiteStatement.h"
 #include "Daemon/TSYURL.h"
 #include "Platform/base/FileDescriptor.h"
@@ -68,38 +69,17 @@ class TSYSQLiteDB {
   TSYResult<void> deleteAllAdvanceCopiesOfCodeSigningEntries();
 
  private:
-  enum class Query : size_t {
-    updateEntry,
-    insertEntry,
-    insertData,
-    insertChild,
-    deleteEntry,
-    invalidateEntry,
-    selectEntry,
-    selectAll,
-    selectIdentifiers,
-    selectChildren,
-    selectParent,
-    deleteAdvanceCopies,
-  };
-  static constexpr size_t kQueryCount = 12;
   // The bits of the column "placeholder".
   static constexpr int kPlaceholderFlag = 1;
   static constexpr int kAdvanceCopyFlag = 2;
-  struct QueryText {
-    const char* sql;
-    const char* kind;  // as messages name it
-  };
-  static const std::array<QueryText, kQueryCount> kQueries;
-  static const QueryText& textOf(Query query) { return kQueries[static_cast<size_t>(query)]; }
-
   sqlite3* openDBWithURL(const TSYURL& url) const;
   // The error that a failed preparation, step or text binding is reported with.
   TSYError bindFailure(const std::string& identifier) const;
   TSYError stepFailure() const;
   // Ready for its values.
-  TSYResult<TSYSQLiteStatement> prepare(Query query);
-  TSYResult<TSYSQLiteStatement> prepareWithIdentifier(Query query, const std::string& identifier);
+  TSYResult<TSYSQLiteStatement> prepare(TSYSQLiteQuery query);
+  TSYResult<TSYSQLiteStatement> prepareWithIdentifier(TSYSQLiteQuery query,
+                                                      const std::string& identifier);
   // Steps a statement that answers no rows.
   TSYResult<void> stepToEnd(TSYSQLiteStatement& statement) const;
 
@@ -109,14 +89,15 @@ class TSYSQLiteDB {
   TSYResult<void> rollBack(TSYError cause);
 
   static constexpr int kAnyChanges = -1;
-  TSYResult<void> _performTwoParameterQuery(Query query, const std::string& one,
+  TSYResult<void> _performTwoParameterQuery(TSYSQLiteQuery query, const std::string& one,
                                             const std::string* two, int expectedChanges);
-  TSYResult<void> _performSingleParameterQuery(Query query, const std::string& one,
+  TSYResult<void> _performSingleParameterQuery(TSYSQLiteQuery query, const std::string& one,
                                                int expectedChanges = kAnyChanges);
   TSYResult<void> _insertChildIdentifier(const std::string& child, const std::string& parent);
   TSYResult<void> bindEntry(TSYSQLiteStatement& statement, const TSYCodeSigningEntry& entry,
                             const std::string& identifier) const;
-  TSYResult<void> _performInsertOrUpdateQuery(Query query, const TSYCodeSigningEntry& entry,
+  TSYResult<void> _performInsertOrUpdateQuery(TSYSQLiteQuery query,
+                                              const TSYCodeSigningEntry& entry,
                                               const std::string& identifier, bool isUpdate);
   TSYResult<void> _insertCodeSigningInfo(const TSYCodeSigningEntry& entry,
                                          const std::string& identifier);
@@ -137,5 +118,5 @@ class TSYSQLiteDB {
   // SQLite opens its files through it.
   const platform::FileDescriptor directory_;
   sqlite3* db_;
-  std::array<sqlite3_stmt*, kQueryCount> statements_{};
+  std::array<sqlite3_stmt*, kTSYSQLiteQueryCount> statements_{};
 };

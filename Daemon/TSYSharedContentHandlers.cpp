@@ -4,11 +4,6 @@
 
 namespace {
 
-std::optional<std::string> stringUnder(const TSYRelayEvent& event, std::string_view key) {
-  const std::string* text = event.request.string(key);
-  return text == nullptr ? std::nullopt : std::optional(*text);
-}
-
 // The data container that the request means, which must be named.
 TSYResolved<TSYContainerIdentity> appDataContainerOf(const TSYRelayEvent& event,
                                                      const TSYClientConnection& connection) {
@@ -28,8 +23,8 @@ TSYResolved<TSYContainerIdentity> appDataContainerOf(const TSYRelayEvent& event,
 
 uint64_t TSYHandleStageSharedContent(TSYRelayEvent& event, TSYClientConnection& connection) {
   const auto staged = connection.stageSharedContentForIdentifier(
-      stringUnder(event, kTSYRequestIdentifier), stringUnder(event, "SourcePath"),
-      stringUnder(event, "DestPath"));
+      TSYStringUnder(event.request, kTSYRequestIdentifier),
+      TSYStringUnder(event.request, "SourcePath"), TSYStringUnder(event.request, "DestPath"));
   if (!staged) return staged.error().clientCode();
   event.reply.set("ReplyPath", staged->path());
   return TSYErrorSuccess;
@@ -50,6 +45,6 @@ uint64_t TSYHandleUserManagedAssetsPath(TSYRelayEvent& event, TSYClientConnectio
 uint64_t TSYHandleDeleteUserManagedAsset(TSYRelayEvent& event, TSYClientConnection& connection) {
   const auto identity = appDataContainerOf(event, connection);
   if (!identity) return identity.error();
-  return connection.deleteUserManagedAssetWithContainerIdentity(*identity,
-                                                                stringUnder(event, "SourcePath"));
+  return connection.deleteUserManagedAssetWithContainerIdentity(
+      *identity, TSYStringUnder(event.request, "SourcePath"));
 }

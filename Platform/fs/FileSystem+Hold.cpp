@@ -23,9 +23,11 @@ bool isEqual(const timespec& one, const timespec& other) {
 }
 
 // Whether a change from `now` on would be seen in the time of the last one. It would not while both
-// fall into one tick of the clock. A time far ahead is one from before the clock was set back.
+// fall into one tick of the clock, or into one second where the file system keeps no parts of one.
+// A time far ahead is one from before the clock was set back.
 bool wouldChangeShow(const timespec& changed, const timespec& now) {
   if (changed.tv_sec > now.tv_sec + 1) return true;
+  if (changed.tv_nsec == 0) return changed.tv_sec < now.tv_sec;
   return changed.tv_sec < now.tv_sec ||
          (changed.tv_sec == now.tv_sec && changed.tv_nsec < now.tv_nsec);
 }

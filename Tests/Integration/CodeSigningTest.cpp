@@ -253,6 +253,7 @@ TEST_F(CodeSigning, ADatabaseThatCannotBeUsedEndsTheStart) {
   Client client = device_->connect(installer());
   EXPECT_EQ(codeOf(client.registerCodeSigningInfo(kApp, informationNaming({}))), kDone);
   EXPECT_EQ(device_->stop(), EXIT_SUCCESS);
+  EXPECT_FALSE(std::filesystem::exists(database + "-wal")) << "the file is whole by itself";
   EXPECT_EQ(integrityOf(database), "ok");
 }
 
