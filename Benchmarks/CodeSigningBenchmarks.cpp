@@ -78,7 +78,8 @@ class BareDatabase {
 
   // What a registration asks and writes.
   void put(const std::string& identifier, const Value::Data& information) {
-    read(identifier);
+    statements_->select.bind(1, identifier);
+    statements_->select.run();
     statements_->begin.run();
     for (BareStatement* each : {&statements_->update, &statements_->insert}) {
       for (int column = 1; column <= 3; ++column) each->bind(column, 0);
@@ -110,26 +111,12 @@ class BareDatabase {
     explicit Statements(sqlite3* db)
         : begin(db, "BEGIN;"),
           commit(db, "COMMIT;"),
-          update(db,
-                 "UPDATE code_signing_info SET invalid=?, placeholder=?, registered_by_caller=?, "
-                 "data_container_class=? WHERE code_signing_id_text=?;"),
-          insert(db,
-                 "INSERT INTO code_signing_info (invalid, placeholder, registered_by_caller, "
-                 "data_container_class, code_signing_id_text) VALUES (?, ?, ?, ?, ?);"),
-          data(db,
-               "INSERT OR REPLACE INTO code_signing_data (cs_info_id, data) SELECT id, ? FROM "
-               "code_signing_info WHERE code_signing_id_text = ?;"),
-          select(db,
-                 "SELECT data, invalid, placeholder, registered_by_caller, data_container_class "
-                 "FROM code_signing_info, code_signing_data WHERE code_signing_info.id = "
-                 "code_signing_data.cs_info_id AND code_signing_id_text = ?;"),
-          children(db,
-                   "SELECT child_code_signing_id_text FROM child_bundles, code_signing_info WHERE "
-                   "code_signing_id_text = ? AND child_bundles.parent_id=code_signing_info.id;"),
-          all(db,
-              "SELECT data, invalid, placeholder, registered_by_caller, data_container_class, "
-              "code_signing_id_text FROM code_signing_info, code_signing_data WHERE "
-              "code_signing_info.id = code_signing_data.cs_info_id;") {}
+          update(db, TSYSQLiteTextOf(TSYSQLiteQuery::updateEntry).sql),
+          insert(db, TSYSQLiteTextOf(TSYSQLiteQuery::insertEntry).sql),
+          data(db, TSYSQLiteTextOf(TSYSQLiteQuery::insertData).sql),
+          select(db, TSYSQLiteTextOf(TSYSQLiteQuery::selectEntry).sql),
+          children(db, TSYSQLiteTextOf(TSYSQLiteQuery::selectChildren).sql),
+          all(db, TSYSQLiteTextOf(TSYSQLiteQuery::selectAll).sql) {}
     BareStatement begin;
     BareStatement commit;
     BareStatement update;

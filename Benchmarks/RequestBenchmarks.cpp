@@ -34,7 +34,7 @@ struct LookupSetUp {
     for (int i = 0; client && i < count; ++i) {
       const auto done = client->registerCodeSigningInfo(
           fmt::format("com.example.registered{}", i),
-          platform::Value::Dictionary{{"com.veltra.Tessary.Entitlements",
+          platform::Value::Dictionary{{tessary::kEntitlementsKey,
                                        platform::Value::Dictionary{{"com.example.right", true}}}});
       if (!done) die(done.error().text);
     }

@@ -185,14 +185,14 @@ class Client {
   Result<void> invalidateCodeSigningInfo();
 
   // Moves an item within the container of a system group of the caller's own; the paths are
-  // relative to the container. Returns where the item is now. Takes an entitlement of its own.
+  // relative to the container. Returns where the item is now. Takes stageSharedContent.
   Result<std::string> stageSharedContent(const std::string& group, const std::string& source,
                                          const std::string& destination);
   // Where an application keeps, in its data container, what its user manages. The caller's own, or
-  // anyone's with the entitlement for it.
+  // anyone's with userManagedAssets. Code 71 when there is none and createIfNecessary is false.
   Result<UserManagedAssets> userManagedAssetsPath(const std::string& identifier,
                                                   const UserManagedAssetsOptions& options = {});
-  // Deletes one item in there. Takes the entitlement, for one's own too.
+  // Deletes one item in there. Takes userManagedAssets, for one's own too.
   Result<void> deleteUserManagedAsset(const std::string& identifier,
                                       const std::string& relativePath);
 

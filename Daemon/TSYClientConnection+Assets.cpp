@@ -1,10 +1,9 @@
 // The directory inside an application's data container for what its user manages.
 //
 // The container's owner may put a link or another item in the place of anything in it while a
-// request runs. So the directory is changed through a descriptor only; a path that was checked is
-// the real one, which holds no link, compared with the container's own, which holds none either;
-// and from then on nothing follows links. What a link put there later leads to is not reached, only
-// missed.
+// request runs. So a new directory is changed through its descriptor only. A path from a client is
+// resolved first; the real path is then compared with the container's, and used without following
+// links. A link put there later is not followed: the item is missed.
 #include "Daemon/TSYCacheSteps.h"
 #include "Daemon/TSYClientConnection.h"
 #include "Daemon/TSYContainerCache.h"

@@ -38,7 +38,7 @@ std::optional<TSYURL> itemInContainer(const TSYMetadata& container, const TSYURL
 TSYResult<TSYURL> stage(const TSYMetadata& container, const std::string& sourceRelativePath,
                         const std::string& destRelativePath) {
   const TSYURL sourceURL = container.url().appending(sourceRelativePath);
-  const TSYURL destURL = container.url().appending(destRelativePath);
+  TSYURL destURL = container.url().appending(destRelativePath);
   const auto source = itemInContainer(container, sourceURL);
   if (!source) {
     return TSYFailure(TSYErrorCreate(TSYErrorInvalidPath, std::nullopt, TSYLogIt::yes,

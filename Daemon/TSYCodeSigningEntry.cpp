@@ -2,6 +2,8 @@
 
 #include <fmt/format.h>
 
+#include "Daemon/TSYPropertyList.h"
+
 using platform::Value;
 
 namespace {
@@ -13,11 +15,6 @@ constexpr char kPlaceholder[] = "Placeholder";
 constexpr char kAdvanceCopy[] = "AdvanceCopy";
 constexpr char kRegisteredByCaller[] = "RegisteredByCaller";
 constexpr char kDataContainerClass[] = "DataContainerClass";
-
-bool flagUnder(const Value::Dictionary& serialized, const char* key) {
-  const auto found = serialized.find(key);
-  return found != serialized.end() && found->second.booleanOfNumber().value_or(false);
-}
 
 Value arrayOf(const std::vector<std::string>& texts) {
   return Value::Array(texts.begin(), texts.end());
@@ -48,10 +45,10 @@ TSYCodeSigningEntry::TSYCodeSigningEntry(Info info, uint64_t containerClass)
 TSYCodeSigningEntry TSYCodeSigningEntry::fromSerializedDictionary(
     const Value::Dictionary& serialized) {
   TSYCodeSigningEntry entry;
-  entry.invalid = flagUnder(serialized, kInvalid);
-  entry.placeholder = flagUnder(serialized, kPlaceholder);
-  entry.advanceCopy = flagUnder(serialized, kAdvanceCopy);
-  entry.registeredByCaller = flagUnder(serialized, kRegisteredByCaller);
+  entry.invalid = TSYFlagUnder(serialized, kInvalid);
+  entry.placeholder = TSYFlagUnder(serialized, kPlaceholder);
+  entry.advanceCopy = TSYFlagUnder(serialized, kAdvanceCopy);
+  entry.registeredByCaller = TSYFlagUnder(serialized, kRegisteredByCaller);
   if (const auto found = serialized.find(kCodeSigningInfo);
       found != serialized.end() && found->second.asDictionary() != nullptr) {
     entry.codeSigningInfo =

@@ -2,8 +2,8 @@
 // read of the database.
 //
 // The mapping alone fills it, on its queue, with what it has just read, and empties it there after
-// every change of the database: so it never holds what the file does not. It is found in from any
-// thread. When it is full it begins anew.
+// every change of the database: once a change has returned nothing older than it is found. find()
+// may be called from any thread. When the cache is full it begins anew.
 #pragma once
 
 #include <optional>

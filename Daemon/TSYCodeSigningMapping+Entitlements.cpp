@@ -4,6 +4,7 @@
 #include "Daemon/TSYCodeSigningKeys.h"
 #include "Daemon/TSYCodeSigningMapping.h"
 #include "Daemon/TSYLog.h"
+#include "Daemon/TSYPropertyList.h"
 
 using platform::Value;
 
@@ -12,9 +13,7 @@ namespace {
 constexpr std::string_view kSystemGroupPrefix = "systemgroup.";
 
 const Value* valueUnder(const TSYCodeSigningMapping::Entitlements& entitlements, const char* key) {
-  if (!entitlements) return nullptr;
-  const auto found = entitlements->find(key);
-  return found == entitlements->end() ? nullptr : &found->second;
+  return entitlements ? TSYValueUnder(*entitlements, key) : nullptr;
 }
 
 }  // namespace
@@ -74,8 +73,7 @@ TSYCodeSigningMapping::Identifiers TSYCodeSigningMapping::_systemGroupIdentifier
 }
 
 bool TSYCodeSigningMapping::_entitlementsHasSystemContainer(const Entitlements& entitlements) {
-  const Value* value = valueUnder(entitlements, kTSYEntitlementSystemContainer);
-  return value != nullptr && value->booleanOfNumber().value_or(false);
+  return entitlements && TSYFlagUnder(*entitlements, kTSYEntitlementSystemContainer);
 }
 
 TSYCodeSigningMapping::Info TSYCodeSigningMapping::_codeSigningInfoForCodeSigningEntry(
@@ -88,9 +86,9 @@ TSYCodeSigningMapping::Info TSYCodeSigningMapping::_codeSigningInfoForCodeSignin
 // Shares the information that it is a part of.
 TSYCodeSigningMapping::Entitlements TSYCodeSigningMapping::_entitlementsFromInfo(const Info& info) {
   if (!info) return nullptr;
-  const auto found = info->find(kTSYCodeSigningEntitlements);
-  if (found == info->end()) return nullptr;
-  const Value::Dictionary* entitlements = found->second.asDictionary();
+  const Value* value = TSYValueUnder(*info, kTSYCodeSigningEntitlements);
+  if (value == nullptr) return nullptr;
+  const Value::Dictionary* entitlements = value->asDictionary();
   return entitlements == nullptr ? nullptr : Entitlements(info, entitlements);
 }
 

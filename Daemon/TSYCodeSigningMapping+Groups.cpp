@@ -15,11 +15,7 @@ using platform::LogLevel;
 
 namespace {
 
-std::string textOf(const TSYCodeSigningMapping::Identifiers& identifiers) {
-  return identifiers ? fmt::format("({})", fmt::join(*identifiers, ", ")) : "(null)";
-}
-
-std::vector<TSYContainerIdentityRef> one(TSYContainerIdentity identity) {
+std::vector<TSYContainerIdentityRef> listOf(TSYContainerIdentity identity) {
   return {std::make_shared<const TSYContainerIdentity>(std::move(identity))};
 }
 
@@ -36,7 +32,7 @@ void TSYCodeSigningMapping::_onQueue_reconcile(const std::string& identifier,
                                                TSYCommandQueue& commandQueue) {
   if (_entitlementsHasSystemContainer(oldEntitlements) &&
       !_entitlementsHasSystemContainer(newEntitlements)) {
-    deleteSystemContainer(identifier, commandQueue);
+    queueDeletionOfSystemContainer(identifier, commandQueue);
   }
   const auto newGroups = _appGroupIdentifiersForIdentifier(identifier, newEntitlements);
   const auto oldGroups = _appGroupIdentifiersForIdentifier(identifier, oldEntitlements);
@@ -49,12 +45,12 @@ void TSYCodeSigningMapping::_onQueue_reconcile(const std::string& identifier,
   TSYSystemLogWrite(TSYChannel::codesignmapping, LogLevel::standard,
                     "Reconciled; old app groups: {}, new app groups: {}, old system groups: {}, "
                     "new system groups: {}",
-                    textOf(oldGroups), textOf(newGroups), textOf(oldSystemGroups),
-                    textOf(newSystemGroups));
+                    TSYListText(oldGroups), TSYListText(newGroups), TSYListText(oldSystemGroups),
+                    TSYListText(newSystemGroups));
 }
 
-void TSYCodeSigningMapping::deleteSystemContainer(const std::string& identifier,
-                                                  TSYCommandQueue& commandQueue) {
+void TSYCodeSigningMapping::queueDeletionOfSystemContainer(const std::string& identifier,
+                                                           TSYCommandQueue& commandQueue) {
   auto identity = TSYContainerIdentity::containerIdentityWithIdentifier(
       identifier, kTSYContainerClassSystemData);
   if (!identity) {
@@ -67,7 +63,7 @@ void TSYCodeSigningMapping::deleteSystemContainer(const std::string& identifier,
               identifier);
   commandQueue.insertCommand(
       TSYCommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
-          one(std::move(*identity)), /*useLocking=*/true,
+          listOf(std::move(*identity)), /*useLocking=*/true,
           [identifier](uint64_t code) {
             TSYLogWrite(TSYLogLevelError,
                         "Failed to destroy system container with identifier {}: {}", identifier,
@@ -98,7 +94,7 @@ void TSYCodeSigningMapping::_onQueue_removeReferenceForGroupIdentifiers(
   if (identifiers.empty()) return;
   if (type == TSYGroupType::system) {
     TSYLogWrite(TSYLogLevelNotice, "Would have removed system group container references for {}",
-                textOf(identifiers));
+                TSYListText(identifiers));
     return;
   }
   const auto counts = _onQueue_copyReferenceCountSetOfType(type);
@@ -121,31 +117,36 @@ void TSYCodeSigningMapping::_onQueue_removeReferenceForGroupIdentifiers(
 
 void TSYCodeSigningMapping::_onQueue_removeGroupContainersIfNeededforUserIdentity(
     const TSYUserIdentityRef& userIdentity, TSYContainerClass groupContainerClass,
-    const std::vector<std::string>& identifiers, ReferenceCounts referenceCounts,
+    const std::vector<std::string>& identifiers, const ReferenceCounts& referenceCounts,
     TSYCommandQueue& commandQueue) {
   for (const std::string& group : identifiers) {
     // The entry that is being changed holds the last reference.
     if (countOf(referenceCounts, group) == 1) {
-      auto identity = TSYContainerIdentity::containerIdentityWithUserIdentity(userIdentity, group,
-                                                                              groupContainerClass);
-      if (identity) {
-        commandQueue.insertCommand(
-            TSYCommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
-                one(std::move(*identity)), /*useLocking=*/true,
-                [group, userIdentity](uint64_t code) {
-                  TSYLogWrite(TSYLogLevelError,
-                              "Failed to destroy group container with identifier {} for {}: {}",
-                              group, userIdentity->shortDescription(), code);
-                },
-                [this, group] { return !isReferenced(group); }));
-      }
-    } else {
-      TSYSystemLogWrite(TSYChannel::codesignmapping, LogLevel::standard,
-                        "Reference count for user: {}, ID: {} is {}",
-                        userIdentity->shortDescription(), group, countOf(referenceCounts, group));
+      queueDeletionOfGroupContainer(userIdentity, group, groupContainerClass, commandQueue);
+      continue;
     }
-    --referenceCounts[group];
+    TSYSystemLogWrite(TSYChannel::codesignmapping, LogLevel::standard,
+                      "Reference count for user: {}, ID: {} is {}",
+                      userIdentity->shortDescription(), group, countOf(referenceCounts, group));
   }
+}
+
+void TSYCodeSigningMapping::queueDeletionOfGroupContainer(const TSYUserIdentityRef& userIdentity,
+                                                          const std::string& group,
+                                                          TSYContainerClass groupContainerClass,
+                                                          TSYCommandQueue& commandQueue) {
+  auto identity = TSYContainerIdentity::containerIdentityWithUserIdentity(userIdentity, group,
+                                                                          groupContainerClass);
+  if (!identity) return;  // logged
+  commandQueue.insertCommand(
+      TSYCommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
+          listOf(std::move(*identity)), /*useLocking=*/true,
+          [group, userIdentity](uint64_t code) {
+            TSYLogWrite(TSYLogLevelError,
+                        "Failed to destroy group container with identifier {} for {}: {}", group,
+                        userIdentity->shortDescription(), code);
+          },
+          [this, group] { return !isReferenced(group); }));
 }
 
 // What cannot be told counts as a reference.
@@ -185,6 +186,6 @@ void TSYCodeSigningMapping::addReferences(ReferenceCounts& counts, TSYGroupType 
   for (const std::string& group : *groups) ++counts[group];
   if (TSYLogIsEnabled(TSYLogLevelDebug)) {
     TSYLogWrite(TSYLogLevelDebug, "Entitlements for identifier {} references container IDs: {}",
-                identifier, textOf(groups));
+                identifier, TSYListText(groups));
   }
 }

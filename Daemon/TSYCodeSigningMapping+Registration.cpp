@@ -14,26 +14,16 @@ using platform::Value;
 
 namespace {
 
-const Value* optionUnder(const Value::Dictionary& options, const char* key) {
-  const auto found = options.find(key);
-  return found == options.end() ? nullptr : &found->second;
-}
-
-bool flagUnder(const Value::Dictionary& options, const char* key) {
-  const Value* value = optionUnder(options, key);
-  return value != nullptr && value->booleanOfNumber().value_or(false);
-}
-
 TSYCodeSigningEntry entryFor(const TSYCodeSigningMapping::Info& info,
                              const Value::Dictionary& options) {
-  const Value* containerClass = optionUnder(options, kTSYOptionDataContainerClass);
+  const Value* containerClass = TSYValueUnder(options, kTSYOptionDataContainerClass);
   const uint64_t number =
       containerClass == nullptr ? 0 : containerClass->unsignedOfNumber().value_or(0);
-  // As it will be read again.
+  // The database keeps 32 bits; an entry that is compared with one read from it has no more.
   TSYCodeSigningEntry entry(info, static_cast<uint32_t>(number));
-  entry.registeredByCaller = flagUnder(options, kTSYOptionRegisteredByCaller);
-  entry.placeholder = flagUnder(options, kTSYOptionPlaceholder);
-  entry.advanceCopy = flagUnder(options, kTSYOptionAdvanceCopy);
+  entry.registeredByCaller = TSYFlagUnder(options, kTSYOptionRegisteredByCaller);
+  entry.placeholder = TSYFlagUnder(options, kTSYOptionPlaceholder);
+  entry.advanceCopy = TSYFlagUnder(options, kTSYOptionAdvanceCopy);
   return entry;
 }
 
@@ -51,11 +41,11 @@ uint64_t TSYCodeSigningMapping::processCodeSigningInfo(const Info& info,
                                                        const Value::Dictionary& options,
                                                        TSYCommandQueue& commandQueue) {
   if (!identifier) return TSYErrorMissingIdentifier;
-  const Entitlements oldEntitlements = entitlementsForIdentifier(*identifier);
+  // Takes over what is with the bundle container: it is what the new information is compared with.
+  (void)entitlementsForIdentifier(*identifier);
   return onQueue([&] {
     queue_.assertCurrent();
-    return _onQueue_processCodeSigningInfo(info, *identifier, options, oldEntitlements,
-                                           commandQueue);
+    return _onQueue_processCodeSigningInfo(info, *identifier, options, commandQueue);
   });
 }
 
@@ -75,7 +65,7 @@ uint64_t TSYCodeSigningMapping::processCallerRegisteredEntitlements(
       Value::Dictionary{{kTSYCodeSigningEntitlements, entitlements}});
   if (!TSYHasPropertyListForm(*info)) return TSYErrorInvalidArgument;
   const TSYAllIdentifiersLock lock(TSYLockMode::writing, /*useLocking=*/true);
-  const Entitlements oldEntitlements = entitlementsForIdentifier(identifier);
+  (void)entitlementsForIdentifier(identifier);
   return onQueue([&]() -> uint64_t {
     queue_.assertCurrent();
     // The installer, or another request of the caller, may have been quicker.
@@ -83,7 +73,7 @@ uint64_t TSYCodeSigningMapping::processCallerRegisteredEntitlements(
     if (!now) return now.error().clientCode();
     if (!isNews(*now)) return TSYErrorSuccess;
     return _onQueue_processCodeSigningInfo(info, identifier, {{kTSYOptionRegisteredByCaller, true}},
-                                           oldEntitlements, commandQueue);
+                                           commandQueue);
   });
 }
 
@@ -103,12 +93,11 @@ void TSYCodeSigningMapping::removeCodeSigningDictionariesForIdentifierAndItsChil
 uint64_t TSYCodeSigningMapping::_onQueue_processCodeSigningInfo(const Info& info,
                                                                 const std::string& identifier,
                                                                 const Value::Dictionary& options,
-                                                                const Entitlements& oldEntitlements,
                                                                 TSYCommandQueue& commandQueue) {
   const bool isInternalImage = TSYGlobalConfiguration::sharedInstance().isInternalImage();
   const auto registered = TSYCatchingExceptionsUnlessInternal(isInternalImage, [&] {
     queue_.assertCurrent();
-    return _onQueue_register(info, identifier, options, oldEntitlements, commandQueue);
+    return _onQueue_register(info, identifier, options, commandQueue);
   });
   return registered ? uint64_t{TSYErrorSuccess} : registered.error().clientCode();
 }
@@ -116,21 +105,19 @@ uint64_t TSYCodeSigningMapping::_onQueue_processCodeSigningInfo(const Info& info
 TSYResult<void> TSYCodeSigningMapping::_onQueue_register(const Info& info,
                                                          const std::string& identifier,
                                                          const Value::Dictionary& options,
-                                                         const Entitlements& oldEntitlements,
                                                          TSYCommandQueue& commandQueue) {
   const auto current = _onQueue_codeSigningEntryForIdentifier(identifier);
   if (!current) return TSYFailure(current.error());
   Writes writes;
-  const Value* parent = optionUnder(options, kTSYOptionParentBundleID);
+  const Value* parent = TSYValueUnder(options, kTSYOptionParentBundleID);
   if (parent != nullptr && parent->asString() != nullptr) {
     auto staged = _onQueue_stageChild(*parent->asString(), identifier, writes);
     if (!staged) return staged;
   }
   const TSYCodeSigningEntry entry = entryFor(info, options);
   if (!*current || **current != entry) {
-    // What is recorded now is newer than what the caller read before the queue.
-    const Entitlements recorded = _entitlementsFromCodeSigningEntry(*current);
-    _onQueue_reconcile(identifier, recorded ? recorded : oldEntitlements,
+    // Before the write: the counts still hold what the entry names now.
+    _onQueue_reconcile(identifier, _entitlementsFromCodeSigningEntry(*current),
                        _entitlementsFromInfo(info), commandQueue);
     writes.emplace_back(identifier, info ? entry : TSYCodeSigningEntry());
   }
@@ -149,7 +136,7 @@ TSYResult<void> TSYCodeSigningMapping::_onQueue_stageChild(const std::string& pa
   if (std::ranges::find(children, identifier) != children.end()) return {};
   children.push_back(identifier);
   TSYLogWrite(TSYLogLevelDebug, "Staging Child Bundles: {} for parent ID: {} by appending: {}",
-              fmt::format("({})", fmt::join(children, ", ")), parent, identifier);
+              TSYListText(children), parent, identifier);
   entry.childBundleIdentifiers = std::move(children);
   writes.emplace_back(parent, std::move(entry));
   return {};

@@ -21,10 +21,6 @@ namespace {
 constexpr char kCachedCodeSigningInfo[] = "com.veltra.Hatchery.CachedCodeSigningInfo";
 constexpr char kCachedEntitlements[] = "Entitlements";
 
-bool isAbsence(const TSYError& error) {
-  return error.is(TSYErrorNotFoundInDatabase);
-}
-
 bool isPlugInClass(uint64_t dataContainerClass) {
   return dataContainerClass >= kTSYContainerClassPluginBundle &&
          dataContainerClass <= kTSYContainerClassVPNPluginData;
@@ -64,6 +60,7 @@ std::unique_ptr<TSYCodeSigningMapping> TSYCodeSigningMapping::openShared() {
 }
 
 TSYCodeSigningMapping& TSYCodeSigningMapping::sharedInstance() {
+  // Never destroyed: threads may still be waiting for its queue when the process ends.
   static TSYCodeSigningMapping& instance = *openShared().release();
   return instance;
 }
@@ -101,7 +98,7 @@ TSYResult<TSYCodeSigningEntryRef> TSYCodeSigningMapping::_onQueue_codeSigningEnt
     const std::string& identifier) {
   if (auto known = entries_.find(identifier)) return std::move(*known);
   auto read = codeSigningMappingDB_->codeSigningEntryWithIdentifier(identifier);
-  if (!read && !isAbsence(read.error())) {
+  if (!read && !read.error().is(TSYErrorNotFoundInDatabase)) {
     TSYLogWrite(TSYLogLevelError, "Error retrieving entry from DB with identifier {} : {}",
                 identifier, read.error());
     return TSYFailure(std::move(read.error()));
@@ -218,7 +215,7 @@ TSYCodeSigningMapping::_onQueue_childBundleIdentifiersForParentIdentifier(
     const std::string& identifier) {
   auto children = codeSigningMappingDB_->childIdentifiersForParentIdentifier(identifier);
   if (children) return std::move(*children);
-  if (!isAbsence(children.error())) {
+  if (!children.error().is(TSYErrorNotFoundInDatabase)) {
     TSYLogWrite(TSYLogLevelError,
                 "Error retrieving child bundles ids from DB with identifier {} : {}", identifier,
                 children.error());
@@ -238,7 +235,7 @@ std::optional<std::string> TSYCodeSigningMapping::_onQueue_parentIdentifierForCh
     const std::string& identifier) {
   auto parent = codeSigningMappingDB_->parentIdentifierForChildIdentifier(identifier);
   if (parent) return std::move(*parent);
-  if (!isAbsence(parent.error())) {
+  if (!parent.error().is(TSYErrorNotFoundInDatabase)) {
     TSYLogWrite(TSYLogLevelError,
                 "Error retrieving child bundles ids from DB with identifier {} : {}", identifier,
                 parent.error());

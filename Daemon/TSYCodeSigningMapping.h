@@ -7,8 +7,11 @@
 // queue of the request.
 //
 // All work on the database runs on one serial queue, onto which the public operations hop;
-// _onQueue_ ones run there. Nothing on the queue asks the container cache, which itself asks the
-// mapping under its lock. Entries that were read stay in memory, bounded.
+// _onQueue_ ones run there. Entries that were read stay in memory, bounded.
+//
+// Nothing on the queue asks the container cache, which itself asks the mapping, for a parent, under
+// its lock. Off the queue all that need entitlements may ask it, so they are not called under its
+// lock.
 //
 // All operations may be called from any thread, but not on the queue. Where said so they take the
 // global write lock; their caller then holds no identifier lock.
@@ -51,8 +54,9 @@ class TSYCodeSigningMapping {
 
   // --- Registering -------------------------------------------------------------------------------
 
-  // Takes the place of what was registered for the identifier; no information forgets it. An entry
-  // that cannot be written is logged. Returns 1, or 18 without an identifier, 66, 40.
+  // Takes the place of what was registered for the identifier; null information forgets it. An
+  // entry that cannot be written is logged, and the answer is 1. Returns 1, or 18 without an
+  // identifier, 66, 40.
   uint64_t processCodeSigningInfo(const Info& info, const std::optional<std::string>& identifier,
                                   const platform::Value::Dictionary& options,
                                   TSYCommandQueue& commandQueue);
@@ -70,7 +74,8 @@ class TSYCodeSigningMapping {
   TSYResult<void> invalidateCodeSigningInfoForIdentifierAndItsChildren(
       const std::string& identifier);
   // Invalidates what the installer has registered and no bundle container is there for. Takes the
-  // global write lock. Returns 1, or 66 when one of them could not be invalidated.
+  // global write lock. Returns 1, also when the identifiers cannot be listed (logged), or 66 when
+  // one of them could not be invalidated.
   uint64_t invalidateCodeSigningInfoForAppsWithoutBundleContainer();
   TSYResult<void> removeAllAdvanceCopies();
   // After an update of the system: takes over what older releases kept elsewhere and removes the
@@ -79,6 +84,7 @@ class TSYCodeSigningMapping {
   void performAllCodeSigningMigrationAndReconciliation();
 
   // --- Asking ------------------------------------------------------------------------------------
+  // An entry that cannot be read counts as none, unless a code is named.
 
   // What a client may be told: nothing of a placeholder, an advance copy or an invalid entry. Takes
   // the global write lock. Null when there is none.
@@ -103,14 +109,15 @@ class TSYCodeSigningMapping {
   // must not be taken for one without.
   std::optional<ReferenceCounts> copyReferenceCountSetOfType(TSYGroupType type);
 
-  // The end of the process: closes the database, whose file is whole by itself then. Nothing runs
-  // on the queue any more, and who asks waits.
+  // For the end of the process: the write-ahead log goes into the database file, and the queue
+  // stands still. Who asks from then on waits for ever.
   void close();
 
   // Whether the calling thread is on the queue.
   bool isOnQueue() const { return queue_.isCurrent(); }
 
   // --- What older releases kept elsewhere --------------------------------------------------------
+  // Both are called under the global write lock.
 
   void migrateAppGroupIdsFromDataContainersToFile();
   void migrateCachedCodeSigningInfoFromBundleContainersToMapping();
@@ -173,11 +180,9 @@ class TSYCodeSigningMapping {
   // Registering.
   uint64_t _onQueue_processCodeSigningInfo(const Info& info, const std::string& identifier,
                                            const platform::Value::Dictionary& options,
-                                           const Entitlements& oldEntitlements,
                                            TSYCommandQueue& commandQueue) REQUIRES(queue_);
   TSYResult<void> _onQueue_register(const Info& info, const std::string& identifier,
                                     const platform::Value::Dictionary& options,
-                                    const Entitlements& oldEntitlements,
                                     TSYCommandQueue& commandQueue) REQUIRES(queue_);
   TSYResult<void> _onQueue_stageChild(const std::string& parent, const std::string& identifier,
                                       Writes& writes) REQUIRES(queue_);
@@ -185,7 +190,7 @@ class TSYCodeSigningMapping {
   void _onQueue_reconcile(const std::string& identifier, const Entitlements& oldEntitlements,
                           const Entitlements& newEntitlements, TSYCommandQueue& commandQueue)
       REQUIRES(queue_);
-  void deleteSystemContainer(const std::string& identifier, TSYCommandQueue& commandQueue);
+  void queueDeletionOfSystemContainer(const std::string& identifier, TSYCommandQueue& commandQueue);
   void _onQueue_handleChangeFromOldGroupContainerIds(const Identifiers& oldIds,
                                                      const Identifiers& newIds, TSYGroupType type,
                                                      TSYCommandQueue& commandQueue)
@@ -195,8 +200,12 @@ class TSYCodeSigningMapping {
       REQUIRES(queue_);
   void _onQueue_removeGroupContainersIfNeededforUserIdentity(
       const TSYUserIdentityRef& userIdentity, TSYContainerClass groupContainerClass,
-      const std::vector<std::string>& identifiers, ReferenceCounts referenceCounts,
+      const std::vector<std::string>& identifiers, const ReferenceCounts& referenceCounts,
       TSYCommandQueue& commandQueue) REQUIRES(queue_);
+  void queueDeletionOfGroupContainer(const TSYUserIdentityRef& userIdentity,
+                                     const std::string& group,
+                                     TSYContainerClass groupContainerClass,
+                                     TSYCommandQueue& commandQueue);
   void _onQueue_setCodeSigningDictionaryValues(const Writes& writes) REQUIRES(queue_);
   void _onQueue_write(const std::string& identifier, const TSYCodeSigningEntry& entry)
       REQUIRES(queue_);

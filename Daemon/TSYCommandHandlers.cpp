@@ -56,12 +56,9 @@ uint64_t TSYHandleSystemContainerPath(TSYRelayEvent& event, TSYClientConnection&
       TSYWhitelist::sharedWhitelist().systemContainerIdIsWellknown(*identifier)) {
     connection.setAllowOtherIdLookup(/*allow=*/true);
   }
-  auto userIdentity =
-      TSYResolveUserIdentityForIdentifier(connection, *identifier, kTSYContainerClassSystemData);
-  if (!userIdentity) return userIdentity.error();
-  auto identity = TSYContainerIdentity::containerIdentityWithUserIdentity(
-      std::move(*userIdentity), *identifier, kTSYContainerClassSystemData);
-  if (!identity) return identity.error().clientCode();
+  auto identity =
+      TSYResolveContainerIdentityOfClass(connection, *identifier, kTSYContainerClassSystemData);
+  if (!identity) return identity.error();
   const auto found = connection.createOrLookupContainerWithContainerIdentity(
       std::move(*identity), /*createIfNecessary=*/true, /*transient=*/false, /*useLocking=*/true);
   if (!found) return found.error().clientCode();

@@ -6,6 +6,7 @@
 
 #include "Daemon/TSYCodeSigningMapping.h"
 #include "Daemon/TSYLog.h"
+#include "Daemon/TSYPropertyList.h"
 
 namespace {
 
@@ -30,9 +31,8 @@ constexpr std::array kClassNames = {
 
 const std::string* nameIn(const platform::Value::Dictionary& entitlements) {
   for (const char* key : kEntitlements) {
-    const auto found = entitlements.find(key);
-    if (found == entitlements.end()) continue;
-    if (const std::string* name = found->second.asString()) return name;
+    const platform::Value* value = TSYValueUnder(entitlements, key);
+    if (value != nullptr && value->asString() != nullptr) return value->asString();
   }
   return nullptr;
 }

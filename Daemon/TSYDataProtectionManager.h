@@ -11,6 +11,7 @@ class TSYDataProtectionManager {
  public:
   static TSYDataProtectionManager& defaultManager();
 
-  // The protection class that the entitlements of an application ask for; 0 for none.
+  // The protection class that the entitlements of an application ask for; 0 when they ask for
+  // nothing, or for an unknown one (logged).
   int intendedDataProtectionClassBasedOnEntitlementsForIdentifier(const std::string& identifier);
 };

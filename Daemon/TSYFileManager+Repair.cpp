@@ -147,7 +147,9 @@ class ACLRepair {
 
   static void report(const platform::ACLResult<void>& applied, std::string_view list,
                      const std::string& path) {
-    if (applied || buildingError(applied.error())) return;  // the second is logged
+    if (applied) return;
+    // One that could not be built is logged there.
+    if (buildingError(applied.error())) return;
     TSYLogWrite(TSYLogLevelError, "Failed to set {} on dir {}: {}", list, path,
                 applied.error().error.message());
   }

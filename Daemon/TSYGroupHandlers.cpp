@@ -40,9 +40,10 @@ void addPersonasAndTokens(const TSYClientConnection::GroupContainers& containers
   if (!personas.empty()) event.reply.set("ReplyPersonaUniqueStringDict", std::move(personas));
 }
 
-// The container of a group that the client's own entitlements name.
-TSYMetadataRef findEntitledGroup(TSYClientConnection& connection, const std::string& owner,
-                                 const TSYUserIdentityRef& userIdentity, const std::string& group) {
+// The container of a group that the client's own entitlements name. Made when it is not there.
+TSYMetadataRef makeOrFindOwnGroup(TSYClientConnection& connection, const std::string& owner,
+                                  const TSYUserIdentityRef& userIdentity,
+                                  const std::string& group) {
   const auto containers = connection.groupContainersForOwnerIdentifier(
       owner, userIdentity, kTSYContainerClassSystemGroup);
   if (containers) {
@@ -55,9 +56,11 @@ TSYMetadataRef findEntitledGroup(TSYClientConnection& connection, const std::str
   return nullptr;
 }
 
-// The container of a group that is open to every client.
-TSYMetadataRef findOpenGroup(TSYClientConnection& connection,
-                             const TSYUserIdentityRef& userIdentity, const std::string& group) {
+// The container of a group that is open to every client. Made when it is not there; the connection
+// may look it up from then on.
+TSYMetadataRef makeOrFindOpenGroup(TSYClientConnection& connection,
+                                   const TSYUserIdentityRef& userIdentity,
+                                   const std::string& group) {
   connection.setAllowGroupIdLookup(/*allow=*/true);
   const auto identity = TSYContainerIdentity::containerIdentityWithUserIdentity(
       userIdentity, group, kTSYContainerClassSystemGroup);
@@ -127,13 +130,10 @@ uint64_t TSYHandleSystemGroupContainerPath(TSYRelayEvent& event, TSYClientConnec
   if (!owner) return TSYErrorMissingIdentifier;
   const std::string& client = connection.clientBundleIdentifier();
   const auto entitled =
-      TSYCodeSigningMapping::sharedInstance().systemGroupIdentifiersForIdentifier(client).value_or(
-          std::vector<std::string>());
-  const std::string* given = event.request.string("GroupIdentifier");
-  const std::string group = given == nullptr ? "(null)" : *given;
-  const std::string entitledText = fmt::format("({})", fmt::join(entitled, ", "));
+      TSYCodeSigningMapping::sharedInstance().systemGroupIdentifiersForIdentifier(client);
+  const auto group = TSYStringUnder(event.request, "GroupIdentifier");
   TSYLogWrite(TSYLogLevelDebug, "Group ID: {}, bundle ID: {}, entitled group container IDs: {}",
-              group, client, entitledText);
+              group.value_or("(null)"), client, TSYListText(entitled));
   const auto userIdentity =
       TSYResolveUserIdentityForIdentifier(connection, *owner, kTSYContainerClassSystemGroup);
   if (!userIdentity) {
@@ -142,22 +142,21 @@ uint64_t TSYHandleSystemGroupContainerPath(TSYRelayEvent& event, TSYClientConnec
                 kTSYContainerClassSystemGroup, userIdentity.error());
     return userIdentity.error();
   }
-  TSYMetadataRef container;
-  if (given != nullptr && std::ranges::find(entitled, group) != entitled.end()) {
-    container = findEntitledGroup(connection, *owner, *userIdentity, group);
-  } else if (given != nullptr &&
-             (TSYWhitelist::sharedWhitelist().systemGroupContainerIdIsWellknown(group) ||
-              connection.allowGroupIdLookup())) {
-    container = findOpenGroup(connection, *userIdentity, group);
-  } else {
+  const bool isOwn = group && entitled && std::ranges::find(*entitled, *group) != entitled->end();
+  const bool isOpen =
+      group && TSYWhitelist::sharedWhitelist().systemGroupContainerIdIsWellknown(*group);
+  if (!isOwn && !isOpen) {
     TSYLogWrite(TSYLogLevelError,
                 "{} is not entitled for system group identifier: {}.  Only entitled for: {}",
-                client, group, entitledText);
+                client, group.value_or("(null)"), TSYListText(entitled));
     return TSYErrorNotEntitled;
   }
+  const TSYMetadataRef container =
+      isOwn ? makeOrFindOwnGroup(connection, *owner, *userIdentity, *group)
+            : makeOrFindOpenGroup(connection, *userIdentity, *group);
   if (!container) {
     TSYLogWrite(TSYLogLevelError, "Did not find system group container with identifier: {} for {}",
-                group, *owner);
+                *group, *owner);
     return TSYErrorNotFound;
   }
   event.reply.set("ReplyPath", container->url().path());

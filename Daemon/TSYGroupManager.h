@@ -20,8 +20,8 @@ class TSYGroupManager {
 
   // Puts the deletion of every group container that no entry names on `commandQueue`, for each user
   // who has it. The commands take no lock: their queue is run while nobody else can look up or
-  // create a container, under the global write lock or before the first request is served. Failures
-  // are logged.
+  // create a container, under the global write lock of whoever asks for the sweep. Failures are
+  // logged.
   void reconcileGroupContainersOfType(TSYGroupType type, TSYCommandQueue& commandQueue);
 
   // The identifiers of the groups that an owner is entitled to: system groups for class 13, else

@@ -2,8 +2,8 @@
 
 #include <cstdlib>
 
-void TSYStopProcess(TSYChannel channel, std::string_view reason) {
-  TSYSystemLogWriteText(channel, platform::LogLevel::fault, "TSYStopProcess", reason);
+void TSYStopProcess(TSYChannel channel, std::string_view reason, std::source_location where) {
+  TSYSystemLogWriteText(channel, platform::LogLevel::fault, TSYFunctionName(where), reason);
   std::_Exit(EXIT_FAILURE);
 }
 

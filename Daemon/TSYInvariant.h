@@ -8,7 +8,8 @@
 #include "Daemon/TSYLog.h"
 
 // Ends the process with a fault in the system log; the service manager sees it fail.
-[[noreturn]] void TSYStopProcess(TSYChannel channel, std::string_view reason);
+[[noreturn]] void TSYStopProcess(TSYChannel channel, std::string_view reason,
+                                 std::source_location where = std::source_location::current());
 
 [[noreturn]] void TSYInvariantBroken(std::string_view invariant, std::source_location where);
 

@@ -163,6 +163,10 @@ void TSYSystemLogWriteText(TSYChannel channel, platform::LogLevel level,
   systemLog().write(level, categoryName(channel), functionName, 0, text);
 }
 
+std::string TSYListText(const std::optional<std::vector<std::string>>& list) {
+  return list ? fmt::format("({})", fmt::join(*list, ", ")) : "(null)";
+}
+
 void TSYInstallUncaughtExceptionHandler() {
   std::set_terminate(reportUncaughtExceptionAndAbort);
 }

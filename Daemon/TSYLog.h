@@ -11,6 +11,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "Daemon/TSYError.h"
 #include "Platform/os/SystemLog.h"
@@ -70,6 +71,9 @@ void TSYSystemLogWrite(TSYChannel channel, platform::LogLevel level,
   TSYSystemLogWriteText(channel, level, TSYFunctionName(format.location),
                         fmt::format(format.format, std::forward<Arguments>(arguments)...));
 }
+
+// A list as messages show it: "(a, b)", or "(null)" without one.
+std::string TSYListText(const std::optional<std::vector<std::string>>& list);
 
 // From now on an exception that nobody catches leaves its text in the log and ends the process.
 void TSYInstallUncaughtExceptionHandler();

@@ -52,6 +52,16 @@ TSYResult<Value::Dictionary> TSY_dictionaryWithContentsOfURL(const TSYURL& url) 
   return std::move(*dictionary);
 }
 
+const Value* TSYValueUnder(const Value::Dictionary& dictionary, std::string_view key) {
+  const auto found = dictionary.find(key);
+  return found == dictionary.end() ? nullptr : &found->second;
+}
+
+bool TSYFlagUnder(const Value::Dictionary& dictionary, std::string_view key) {
+  const Value* value = TSYValueUnder(dictionary, key);
+  return value != nullptr && value->booleanOfNumber().value_or(false);
+}
+
 bool TSYHasPropertyListForm(const Value& value) {
   const auto form = platform::writeBinaryPropertyList(value);
   if (!form) TSYLogWrite(TSYLogLevelError, "No property-list form: {}", form.error().reason);

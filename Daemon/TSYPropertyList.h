@@ -24,6 +24,12 @@ TSYResult<void> TSY_writeToURL(const platform::Value::Dictionary& dictionary, co
 // Reads a file of at most 16 MiB that holds a dictionary, in any property-list format.
 TSYResult<platform::Value::Dictionary> TSY_dictionaryWithContentsOfURL(const TSYURL& url);
 
+// The value under a key; null when there is none.
+const platform::Value* TSYValueUnder(const platform::Value::Dictionary& dictionary,
+                                     std::string_view key);
+// Whether a number that is true is there.
+bool TSYFlagUnder(const platform::Value::Dictionary& dictionary, std::string_view key);
+
 // Whether a value from outside can be stored at all: the reason why not is logged.
 bool TSYHasPropertyListForm(const platform::Value& value);
 

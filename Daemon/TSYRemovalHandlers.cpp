@@ -67,11 +67,8 @@ uint64_t wipe(const TSYRelayEvent& event, TSYClientConnection& connection,
     TSYLogWrite(TSYLogLevelError, "Can't wipe container with nil identifier: {}", "(null)");
     return TSYErrorMissingIdentifier;
   }
-  auto userIdentity = TSYResolveUserIdentityForIdentifier(connection, *identifier, containerClass);
-  if (!userIdentity) return userIdentity.error();
-  const auto identity = TSYContainerIdentity::containerIdentityWithUserIdentity(
-      std::move(*userIdentity), *identifier, containerClass);
-  if (!identity) return identity.error().clientCode();
+  const auto identity = TSYResolveContainerIdentityOfClass(connection, *identifier, containerClass);
+  if (!identity) return identity.error();
   return connection.deleteDataContainerContentWithContainerIdentity(*identity);
 }
 

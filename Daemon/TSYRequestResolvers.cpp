@@ -170,10 +170,16 @@ TSYResolved<TSYContainerIdentity> TSYResolveContainerIdentity(const Message& req
   if (!identifier) return std::unexpected(uint64_t{TSYErrorMissingIdentifier});
   const auto containerClass = resolveClass(request, kTSYRequestContainerClass);
   if (!containerClass) return std::unexpected(containerClass.error());
-  auto userIdentity = TSYResolveUserIdentityForIdentifier(connection, *identifier, *containerClass);
+  return TSYResolveContainerIdentityOfClass(connection, *identifier, *containerClass);
+}
+
+TSYResolved<TSYContainerIdentity> TSYResolveContainerIdentityOfClass(
+    const TSYClientConnection& connection, const std::string& identifier,
+    TSYContainerClass containerClass) {
+  auto userIdentity = TSYResolveUserIdentityForIdentifier(connection, identifier, containerClass);
   if (!userIdentity) return std::unexpected(userIdentity.error());
   auto identity = TSYContainerIdentity::containerIdentityWithUserIdentity(
-      std::move(*userIdentity), *identifier, *containerClass);
+      std::move(*userIdentity), identifier, containerClass);
   if (!identity) return std::unexpected(identity.error().clientCode());
   return std::move(*identity);
 }

@@ -40,7 +40,8 @@ TSYResolved<TSYUserIdentityRef> TSYResolveUserIdentityForIdentifier(
     TSYContainerClass containerClass);
 
 // Whose groups of an owner are meant: as above, for the application that the owner belongs to. But
-// code 76 too when several personas, or none, may own them: a guess would hand out another's data.
+// code 76 too when nobody may own them, or several and not the client: a guess would hand out
+// another's data.
 TSYResolved<TSYUserIdentityRef> TSYResolveUserIdentityForGroupOwner(
     const TSYClientConnection& connection, const std::string& owner);
 
@@ -48,6 +49,11 @@ TSYResolved<TSYUserIdentityRef> TSYResolveUserIdentityForGroupOwner(
 TSYResolved<TSYContainerIdentity> TSYResolveContainerIdentity(const platform::ipc::Message& request,
                                                               const TSYClientConnection& connection,
                                                               TSYIdentifierFallback fallback);
+// The same for a class and an identifier that are known. Codes 76 and those of
+// TSYContainerIdentity.
+TSYResolved<TSYContainerIdentity> TSYResolveContainerIdentityOfClass(
+    const TSYClientConnection& connection, const std::string& identifier,
+    TSYContainerClass containerClass);
 
 // The identity of a persona. Code 76 for an unknown one, and for one that is not the client's own
 // when the client has a specific persona.

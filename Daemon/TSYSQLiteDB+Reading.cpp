@@ -20,17 +20,13 @@ TSYError formattingError(std::string reason,
                    .sourceFileLine = where.line()});
 }
 
-bool isAbsence(const TSYError& error) {
-  return error.is(TSYErrorNotFoundInDatabase);
-}
-
 }  // namespace
 
 TSYResult<TSYCodeSigningEntry> TSYSQLiteDB::codeSigningEntryWithIdentifier(
     const std::string& identifier) {
   auto entry = _selectCodeSigningEntryWithIdentifier(identifier);
   if (!entry) {
-    if (!isAbsence(entry.error())) {
+    if (!entry.error().is(TSYErrorNotFoundInDatabase)) {
       TSYLogWrite(TSYLogLevelError, "Error retrieving code signing entry: {}", entry.error());
     }
     return entry;
@@ -89,7 +85,7 @@ TSYResult<void> TSYSQLiteDB::addChildren(TSYCodeSigningEntry& entry,
     entry.childBundleIdentifiers = std::move(*children);
     return {};
   }
-  if (isAbsence(children.error())) return {};
+  if (children.error().is(TSYErrorNotFoundInDatabase)) return {};
   return TSYFailure(std::move(children.error()));
 }
 

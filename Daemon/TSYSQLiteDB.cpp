@@ -151,6 +151,7 @@ TSYResult<void> TSYSQLiteDB::inTransaction(const std::function<TSYResult<void>()
   const bool isInternalImage = TSYGlobalConfiguration::sharedInstance().isInternalImage();
   const auto done = TSYCatchingExceptionsUnlessInternal(isInternalImage, work);
   if (!done) return rollBack(done.error());
+  // A commit that fails is logged and counts as success; who must know reads again.
   if (const auto committed = _sqliteExec("COMMIT;"); !committed) {
     (void)TSYErrorCreate(TSYErrorDatabase, committed.error(), TSYLogIt::yes,
                          "failed _sqliteExec commit");
@@ -165,6 +166,14 @@ TSYResult<void> TSYSQLiteDB::rollBack(TSYError cause) {
                                    "failed _sqliteExec rollback"));
 }
 
+TSYResult<void> TSYSQLiteDB::checkChanges(TSYSQLiteQuery query, int expected) const {
+  const int changes = sqlite3_changes(db_);
+  if (expected == kAnyChanges || changes == expected) return {};
+  return TSYFailure(TSYErrorCreate(TSYErrorDatabaseChangeCount, std::nullopt, TSYLogIt::no,
+                                   "sqlite3_changes for {} in {}: {}, but expecting {}",
+                                   TSYSQLiteTextOf(query).sql, url_.path(), changes, expected));
+}
+
 TSYResult<void> TSYSQLiteDB::_performTwoParameterQuery(TSYSQLiteQuery query, const std::string& one,
                                                        const std::string* two,
                                                        int expectedChanges) {
@@ -172,12 +181,7 @@ TSYResult<void> TSYSQLiteDB::_performTwoParameterQuery(TSYSQLiteQuery query, con
   if (!statement) return TSYFailure(std::move(statement.error()));
   if (two != nullptr && !statement->bind(2, *two)) return TSYFailure(bindFailure(*two));
   if (auto stepped = stepToEnd(*statement); !stepped) return stepped;
-  const int changes = sqlite3_changes(db_);
-  if (expectedChanges == kAnyChanges || changes == expectedChanges) return {};
-  return TSYFailure(TSYErrorCreate(TSYErrorDatabaseChangeCount, std::nullopt, TSYLogIt::no,
-                                   "sqlite3_changes for {} in {}: {}, but expecting {}",
-                                   TSYSQLiteTextOf(query).sql, url_.path(), changes,
-                                   expectedChanges));
+  return checkChanges(query, expectedChanges);
 }
 
 TSYResult<void> TSYSQLiteDB::_performSingleParameterQuery(TSYSQLiteQuery query,
@@ -230,34 +234,35 @@ TSYResult<void> TSYSQLiteDB::_insertCodeSigningInfo(const TSYCodeSigningEntry& e
 TSYResult<void> TSYSQLiteDB::bindEntry(TSYSQLiteStatement& statement,
                                        const TSYCodeSigningEntry& entry,
                                        const std::string& identifier) const {
-  const auto failed = [](TSYError error) { return TSYFailure(std::move(error)); };
   const int flags =
       (entry.placeholder ? kPlaceholderFlag : 0) | (entry.advanceCopy ? kAdvanceCopyFlag : 0);
   if (!statement.bind(1, int{entry.invalid})) {
-    return failed(TSYErrorCreate(TSYErrorDatabase, std::nullopt, TSYLogIt::yes,
-                                 "sqlite3_bind_int for invalid={:d} at {} failed: {}",
-                                 entry.invalid, url_.path(), sqlite3_errmsg(db_)));
+    return TSYFailure(TSYErrorCreate(TSYErrorDatabase, std::nullopt, TSYLogIt::yes,
+                                     "sqlite3_bind_int for invalid={:d} at {} failed: {}",
+                                     entry.invalid, url_.path(), sqlite3_errmsg(db_)));
   }
   if (!statement.bind(2, flags)) {
-    return failed(TSYErrorCreate(
+    return TSYFailure(TSYErrorCreate(
         TSYErrorDatabase, std::nullopt, TSYLogIt::yes,
         "sqlite3_bind_int for placeholder={:d}, advance_copy={:d} (flags={}) at {} failed: {}",
         entry.placeholder, entry.advanceCopy, flags, url_.path(), sqlite3_errmsg(db_)));
   }
   if (!statement.bind(3, int{entry.registeredByCaller})) {
-    return failed(TSYErrorCreate(TSYErrorDatabase, std::nullopt, TSYLogIt::yes,
-                                 "sqlite3_bind_int for registered_by_caller={:d} at {} failed: {}",
-                                 entry.registeredByCaller, url_.path(), sqlite3_errmsg(db_)));
+    return TSYFailure(
+        TSYErrorCreate(TSYErrorDatabase, std::nullopt, TSYLogIt::yes,
+                       "sqlite3_bind_int for registered_by_caller={:d} at {} failed: {}",
+                       entry.registeredByCaller, url_.path(), sqlite3_errmsg(db_)));
   }
   if (!statement.bind(4, withoutHigherBits(entry.dataContainerClass))) {
-    return failed(TSYErrorCreate(TSYErrorDatabase, std::nullopt, TSYLogIt::yes,
-                                 "sqlite3_bind_int for data_container_class={} at {} failed: {}",
-                                 entry.dataContainerClass, url_.path(), sqlite3_errmsg(db_)));
+    return TSYFailure(
+        TSYErrorCreate(TSYErrorDatabase, std::nullopt, TSYLogIt::yes,
+                       "sqlite3_bind_int for data_container_class={} at {} failed: {}",
+                       entry.dataContainerClass, url_.path(), sqlite3_errmsg(db_)));
   }
   if (!statement.bind(5, identifier)) {
-    return failed(TSYErrorCreate(TSYErrorDatabase, std::nullopt, TSYLogIt::yes,
-                                 "sqlite3_bind_text for code_signing_id={} at {} failed: {}",
-                                 identifier, url_.path(), sqlite3_errmsg(db_)));
+    return TSYFailure(TSYErrorCreate(TSYErrorDatabase, std::nullopt, TSYLogIt::yes,
+                                     "sqlite3_bind_text for code_signing_id={} at {} failed: {}",
+                                     identifier, url_.path(), sqlite3_errmsg(db_)));
   }
   return {};
 }
@@ -270,11 +275,7 @@ TSYResult<void> TSYSQLiteDB::_performInsertOrUpdateQuery(TSYSQLiteQuery query,
   if (!statement) return TSYFailure(std::move(statement.error()));
   if (auto bound = bindEntry(*statement, entry, identifier); !bound) return bound;
   if (auto stepped = stepToEnd(*statement); !stepped) return stepped;
-  const int changes = sqlite3_changes(db_);
-  if (!isUpdate || changes == 1) return {};
-  return TSYFailure(TSYErrorCreate(TSYErrorDatabaseChangeCount, std::nullopt, TSYLogIt::no,
-                                   "sqlite3_changes for {} in {}: {}, but expecting 1",
-                                   TSYSQLiteTextOf(query).sql, url_.path(), changes));
+  return checkChanges(query, isUpdate ? 1 : kAnyChanges);
 }
 
 TSYResult<void> TSYSQLiteDB::_insertCodeSigningData(const TSYCodeSigningEntry& entry,

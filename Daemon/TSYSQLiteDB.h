@@ -31,7 +31,7 @@ class TSYSQLiteDB {
   TSYSQLiteDB(const TSYSQLiteDB&) = delete;
   TSYSQLiteDB& operator=(const TSYSQLiteDB&) = delete;
 
-  // Null once closed.
+  // For tests. Null once closed.
   sqlite3* db() const { return db_; }
   const TSYURL& url() const { return url_; }
   // Nothing may be asked of the object from then on.
@@ -39,7 +39,7 @@ class TSYSQLiteDB {
 
   // Writes an entry whole, over one that is there. Its children are added to those the identifier
   // has, and taken away from other parents. All or nothing, but for a child that cannot be added
-  // (logged). Code 40 too.
+  // (logged). A commit that fails is logged and counts as success. Code 40 too.
   TSYResult<void> addCodeSigningEntry(const TSYCodeSigningEntry& entry,
                                       const std::string& identifier);
   // Removes an entry and its tie to its children. An unknown identifier fails, with 68 underneath.
@@ -89,6 +89,8 @@ class TSYSQLiteDB {
   TSYResult<void> rollBack(TSYError cause);
 
   static constexpr int kAnyChanges = -1;
+  // Code 68 when the last statement has changed another number of rows.
+  TSYResult<void> checkChanges(TSYSQLiteQuery query, int expected) const;
   TSYResult<void> _performTwoParameterQuery(TSYSQLiteQuery query, const std::string& one,
                                             const std::string* two, int expectedChanges);
   TSYResult<void> _performSingleParameterQuery(TSYSQLiteQuery query, const std::string& one,

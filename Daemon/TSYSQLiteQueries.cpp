@@ -25,6 +25,7 @@ const char kTSYSQLiteSchema[] =
 
 namespace {
 
+// In the order of TSYSQLiteQuery.
 constexpr std::array<TSYSQLiteQueryText, kTSYSQLiteQueryCount> kQueries = {{
     {"UPDATE code_signing_info SET invalid=?, placeholder=?, registered_by_caller=?, "
      "data_container_class=? WHERE code_signing_id_text=?;",

@@ -24,7 +24,7 @@ inline constexpr size_t kTSYSQLiteQueryCount = 12;
 
 struct TSYSQLiteQueryText {
   const char* sql;
-  const char* kind;  // as messages name it
+  const char* kind;  // as messages name it: "insert" for whatever changes one identifier
 };
 
 const TSYSQLiteQueryText& TSYSQLiteTextOf(TSYSQLiteQuery query);

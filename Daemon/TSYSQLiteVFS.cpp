@@ -1,6 +1,6 @@
-// SQLite's own virtual file system but for one thing: it takes the name of a database as it is. Its
-// own would resolve it, to a path that may be longer than the 512 bytes that it takes. And nothing
-// is put aside in temporary files, which would lie outside the root.
+// Two things differ from SQLite's own virtual file system. The name of a database is taken as it
+// is: SQLite would resolve it, and refuse a path of over 512 bytes. And statement journals stay in
+// memory instead of files outside the root.
 #include "Daemon/TSYSQLiteVFS.h"
 
 #include <sqlite3.h>
@@ -16,7 +16,7 @@ int takeAsItIs(sqlite3_vfs* /*vfs*/, const char* name, int size, char* fullName)
 
 bool registerVFS() {
   constexpr int kNever = -1;
-  sqlite3_config(SQLITE_CONFIG_STMTJRNL_SPILL, kNever);
+  if (sqlite3_config(SQLITE_CONFIG_STMTJRNL_SPILL, kNever) != SQLITE_OK) return false;
   const sqlite3_vfs* own = sqlite3_vfs_find(nullptr);
   if (own == nullptr) return false;
   static sqlite3_vfs vfs = *own;

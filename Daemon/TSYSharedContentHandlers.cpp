@@ -10,13 +10,7 @@ TSYResolved<TSYContainerIdentity> appDataContainerOf(const TSYRelayEvent& event,
   const auto identifier =
       TSYResolveIdentifier(event.request, connection, TSYIdentifierFallback::none);
   if (!identifier) return std::unexpected(uint64_t{TSYErrorMissingIdentifier});
-  auto userIdentity =
-      TSYResolveUserIdentityForIdentifier(connection, *identifier, kTSYContainerClassAppData);
-  if (!userIdentity) return std::unexpected(userIdentity.error());
-  auto identity = TSYContainerIdentity::containerIdentityWithUserIdentity(
-      std::move(*userIdentity), *identifier, kTSYContainerClassAppData);
-  if (!identity) return std::unexpected(identity.error().clientCode());
-  return std::move(*identity);
+  return TSYResolveContainerIdentityOfClass(connection, *identifier, kTSYContainerClassAppData);
 }
 
 }  // namespace

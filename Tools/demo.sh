@@ -127,7 +127,7 @@ show_tree
 
 title "the application goes: what was registered for it goes too, and with it the group containers"
 control delete --class 1 com.example.office
-control groups com.example.office
+control list --class 7
 
 title "a client without rights asks for another's container"
 if as com.example.spy -- lookup --class 2 com.example.photos; then

@@ -22,9 +22,9 @@ bool isEqual(const timespec& one, const timespec& other) {
   return one.tv_sec == other.tv_sec && one.tv_nsec == other.tv_nsec;
 }
 
-// Whether a change from `now` on would be seen in the time of the last one. It would not while both
-// fall into one tick of the clock, or into one second where the file system keeps no parts of one.
-// A time far ahead is one from before the clock was set back.
+// Whether a change made from `now` on would get another change time than `changed`. It would not
+// while both fall into one tick of the clock, or into one second where the file system keeps no
+// parts of one. A time far ahead is one from before the clock was set back.
 bool wouldChangeShow(const timespec& changed, const timespec& now) {
   if (changed.tv_sec > now.tv_sec + 1) return true;
   if (changed.tv_nsec == 0) return changed.tv_sec < now.tv_sec;

@@ -112,7 +112,7 @@ class FileSystem {
                                              const std::string& prefix) const;
   // The same in a directory that somebody else may be changing, held open: what is done through the
   // descriptor is done to the new directory, whatever stands at its name by then. ESTALE when
-  // something else stood there at once. No default ACL is applied beyond what mkdir(2) does.
+  // something else stood there at once. The mask of an inherited ACL is not widened again.
   struct NewDirectory {
     std::string name;  // in the parent
     FileDescriptor directory;

@@ -216,7 +216,8 @@ TEST_F(TSYCodeSigningMappingTest, withoutItsBundleAnInstalledApplicationIsInvali
   registerCaller({}, "caller");
   EXPECT_EQ(mapping_.invalidateCodeSigningInfoForAppsWithoutBundleContainer(), 1U);
   std::set<std::string> valid;
-  for (const std::string& identifier : mapping_.identifiers().value()) {
+  const auto identifiers = mapping_.identifiers();
+  for (const std::string& identifier : identifiers.value()) {
     if (!(*mapping_.codeSigningEntryForIdentifier(identifier))->invalid) valid.insert(identifier);
   }
   EXPECT_THAT(valid, UnorderedElementsAre("installed", "installed plugin", "caller"));
@@ -375,10 +376,9 @@ TEST(TSYCodeSigningMappingProperty, groupContainersAreThoseThatSomeEntryNames) {
     std::set<std::string> named;
     for (const auto& [group, count] : counts) named.insert(group);
     std::set<std::string> onDisk;
-    for (const auto& container :
-         TSYContainerCache::sharedInstance()
-             .allContainersForUserIdentity(user, kGroup, /*transient=*/false)
-             .value()) {
+    const auto listed = TSYContainerCache::sharedInstance().allContainersForUserIdentity(
+        user, kGroup, /*transient=*/false);
+    for (const TSYMetadataRef& container : listed.value()) {
       onDisk.insert(container->identifier());
     }
     ASSERT_EQ(onDisk, named) << "step " << step;

@@ -225,7 +225,7 @@ TEST_F(Rights, OfEachEntitlementOverTheRows) {
     tessary::Client client = device_->connect(grant.caller);
     for (uint64_t command = 0; command < kCommandCount; ++command) {
       // What anybody may ask of commands 15 and 17: for well-known names. Elsewhere his own count.
-      Message request({{"GroupIdentifier", "systemgroup.com.veltra.tiles"}});
+      Message request(Dictionary{{"GroupIdentifier", "systemgroup.com.veltra.tiles"}});
       if (command == kSystemContainerPath) request.set("Identifier", "com.veltra.exampled");
       const uint64_t code = codeOf(client, command, std::move(request));
       const bool open = contains(forAnybody, command) || contains(grant.opened, command);
