@@ -209,19 +209,4 @@ TEST_F(TSYSQLiteDBTest, worksBelowARootOfAnyLength) {
   EXPECT_EQ(again.codeSigningEntryWithIdentifier("app").value(), entryOf("far"));
 }
 
-using TSYSQLiteDBDeathTest = TSYSQLiteDBTest;
-
-TEST_F(TSYSQLiteDBDeathTest, aFileThatIsNoDatabaseEndsTheProcess) {
-  GTEST_FLAG_SET(death_test_style, "threadsafe");
-  device_.write("/garbage/containers.sqlite3", std::string(8192, 'x'));
-  std::filesystem::create_directories(device_.path("/directory/containers.sqlite3"));
-  for (const auto& [place, words] :
-       std::map<std::string, std::string>{{"/garbage", "Failed to initialize database, err = 26"},
-                                          {"/directory", "Failed to open database, err = 14"},
-                                          {"/missing", "Failed to open database, err = 14"}}) {
-    EXPECT_EXIT(TSYSQLiteDB(TSYURL(device_.path(place))), testing::ExitedWithCode(EXIT_FAILURE),
-                lastWords(words));
-  }
-}
-
 }  // namespace
