@@ -4,10 +4,13 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <sqlite3.h>
+#include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/un.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 
+#include <array>
 #include <filesystem>
 #include <fstream>
 #include <set>
@@ -243,13 +246,45 @@ TEST_F(CodeSigning, ARegistrationThatIsInterruptedIsDoneOrNot) {
   EXPECT_GT(points, 4U);
 }
 
+// What a service manager is told by the daemons that the test starts.
+class ServiceManagerSocket {
+ public:
+  explicit ServiceManagerSocket(const std::string& path) {
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    path.copy(address.sun_path, sizeof address.sun_path - 1);
+    EXPECT_EQ(::bind(socket_.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address),
+              0);
+    ::setenv("NOTIFY_SOCKET", path.c_str(), /*replace=*/1);
+  }
+  ~ServiceManagerSocket() { ::unsetenv("NOTIFY_SOCKET"); }
+  ServiceManagerSocket(const ServiceManagerSocket&) = delete;
+  ServiceManagerSocket& operator=(const ServiceManagerSocket&) = delete;
+
+  // Everything since the last call.
+  std::string take() {
+    std::string all;
+    std::array<char, 4096> text{};
+    for (ssize_t size = 0;
+         (size = ::recv(socket_.get(), text.data(), text.size(), MSG_DONTWAIT)) > 0;) {
+      all.append(text.data(), static_cast<size_t>(size));
+    }
+    return all;
+  }
+
+ private:
+  const platform::FileDescriptor socket_{::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0)};
+};
+
 TEST_F(CodeSigning, ADatabaseThatCannotBeUsedEndsTheStart) {
+  ServiceManagerSocket serviceManager(device_->root() + "/notify");
   const std::string database = device_->path(kDatabase);
   const std::string log = device_->root() + "/failed.log";
   const auto expectFailedStart = [&](const std::string& words) {
     const pid_t daemon =
         startInBackground({Device::program("tessaryd"), "--root", device_->root()}, log);
     EXPECT_EQ(waitForExit(daemon), EXIT_FAILURE);
+    EXPECT_EQ(serviceManager.take(), "") << "it was never ready";
     if (::access("/run/systemd/journal/socket", W_OK) == 0) return;
     std::ifstream stream(log);
     const std::string text{std::istreambuf_iterator<char>(stream), {}};
@@ -263,6 +298,11 @@ TEST_F(CodeSigning, ADatabaseThatCannotBeUsedEndsTheStart) {
   std::filesystem::remove(database);
   device_->start();
   Client client = device_->connect(installer());
+  std::string told;
+  EXPECT_TRUE(becomes([&] {
+    told += serviceManager.take();
+    return told.find("READY=1") != std::string::npos;
+  })) << told;
   EXPECT_EQ(codeOf(client.registerCodeSigningInfo(kApp, informationNaming({}))), kDone);
   EXPECT_EQ(device_->stop(), EXIT_SUCCESS);
   EXPECT_FALSE(std::filesystem::exists(database + "-wal")) << "the file is whole by itself";
