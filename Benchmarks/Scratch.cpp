@@ -18,6 +18,7 @@
 #include "Platform/ipc/Codec.h"
 #include "Platform/ipc/SocketPath.h"
 #include "Platform/os/Tasks.h"
+#include "Tests/ScratchDirectory.h"
 
 using platform::FileDescriptor;
 using platform::Value;
@@ -30,11 +31,10 @@ void die(std::string_view reason) {
 
 namespace {
 
-std::string makeScratchDirectory() {
-  std::string pattern = std::filesystem::temp_directory_path().string() + "/tessary-bench-XXXXXX";
-  if (::mkdtemp(pattern.data()) == nullptr) die("cannot make " + pattern);
-  if (::chmod(pattern.c_str(), 0755) != 0) die("cannot chmod " + pattern);
-  return std::filesystem::canonical(pattern).string();
+std::string makeRoot() {
+  const std::string root = makeScratchDirectory();
+  if (::chmod(root.c_str(), 0755) != 0) die("cannot chmod " + root);
+  return root;
 }
 
 pid_t startProgram(const std::vector<std::string>& arguments) {
@@ -123,7 +123,7 @@ std::vector<uint8_t> containerFrame(const std::string& identifier, bool createIf
 
 }  // namespace
 
-ScratchDevice::ScratchDevice() : root_(makeScratchDirectory()) {
+ScratchDevice::ScratchDevice() : root_(makeRoot()) {
   const pid_t init = startProgram(
       {std::string(TESSARY_BINARY_DIRECTORY) + "/tessary-platform", "--root", root_, "init"});
   int status = 0;
@@ -178,7 +178,7 @@ FileDescriptor ScratchDevice::connect() const {
   return std::move(*socket);
 }
 
-EchoServer::EchoServer(size_t requestSize, size_t replySize) : directory_(makeScratchDirectory()) {
+EchoServer::EchoServer(size_t requestSize, size_t replySize) : directory_(makeRoot()) {
   auto listener = platform::ipc::listenAt(directory_ + "/echo", SOCK_STREAM, 0600);
   if (!listener) die("cannot listen: " + listener.error().message());
   ::fcntl(listener->get(), F_SETFL, ::fcntl(listener->get(), F_GETFL) & ~O_NONBLOCK);

@@ -139,12 +139,6 @@ bool TSYCodeSigningMapping::identifierHasCallerRegisteredEntitlements(
 
 // --- Entitlements -------------------------------------------------------------------------------
 
-TSYCodeSigningMapping::Entitlements TSYCodeSigningMapping::_onQueue_entitlementsForIdentifier(
-    const std::string& identifier) {
-  return _entitlementsFromInfo(
-      _onQueue_codeSigningInfoForIdentifier(identifier, /*externalRequest=*/false));
-}
-
 TSYCodeSigningMapping::Entitlements TSYCodeSigningMapping::entitlementsForIdentifier(
     const std::string& identifier) {
   const auto entry = codeSigningEntryForIdentifier(identifier);

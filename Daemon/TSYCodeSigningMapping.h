@@ -167,7 +167,6 @@ class TSYCodeSigningMapping {
       const std::string& identifier) REQUIRES(queue_);
   Info _onQueue_codeSigningInfoForIdentifier(const std::string& identifier, bool externalRequest)
       REQUIRES(queue_);
-  Entitlements _onQueue_entitlementsForIdentifier(const std::string& identifier) REQUIRES(queue_);
   Identifiers _onQueue_childBundleIdentifiersForParentIdentifier(const std::string& identifier)
       REQUIRES(queue_);
   std::optional<std::string> _onQueue_parentIdentifierForChildIdentifier(

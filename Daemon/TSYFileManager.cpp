@@ -33,8 +33,10 @@ TSYError creationError(const std::string& path, bool withIntermediateDirectories
 }
 
 TSYError temporaryDirectoryError(const TSYURL& parent, const std::string& prefix, Errno error) {
+  // As a template of mkdtemp(3) has it.
+  const std::string name = prefix + std::string(/*random characters*/ 6, 'X');
   return TSYPosixErrorCreate(error, "Failed to create temp dir at path {} : {}",
-                             parent.appending(prefix + "XXXXXX").path(), error.message());
+                             parent.appending(name).path(), error.message());
 }
 
 // Whether an allowed missing source ends the operation.

@@ -11,15 +11,14 @@
 #include <string>
 
 #include "Platform/os/Platform.h"
+#include "Tests/ScratchDirectory.h"
 
 class FuzzDevice {
  public:
   FuzzDevice() {
     ::setenv("TESSARY_LOG_LEVEL", "fault", 1);  // every rejection is logged
     // In memory where that is possible: what takes the time is making files.
-    const char* const directory = ::access("/dev/shm", W_OK) == 0 ? "/dev/shm" : "/tmp";
-    root_ = std::filesystem::canonical(directory).string() + "/tessary-fuzz.XXXXXX";
-    if (::mkdtemp(root_.data()) == nullptr) std::abort();
+    root_ = makeScratchDirectory(::access("/dev/shm", W_OK) == 0 ? "/dev/shm" : "/tmp");
     std::filesystem::create_directories(root_ + "/etc");
     std::ofstream(root_ + "/etc/passwd") << "mobile:x:501:501::/private/var/mobile:/bin/sh\n";
     auto device = platform::DevicePlatform::open(root_);

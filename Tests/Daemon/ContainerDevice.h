@@ -27,6 +27,7 @@
 #include "Platform/os/Platform.h"
 #include "Platform/os/SandboxLog.h"
 #include "Platform/values/PropertyList.h"
+#include "Tests/ScratchDirectory.h"
 
 inline platform::PersonaAttributes makePersona(platform::PersonaKind kind, uint32_t personaID,
                                                std::optional<std::string> uniqueString,
@@ -176,11 +177,6 @@ class ContainerDevice {
   }
 
  private:
-  static std::string makeRoot() {
-    std::string root = std::filesystem::canonical(testing::TempDir()).string() + "/tessary.XXXXXX";
-    if (::mkdtemp(root.data()) == nullptr) throw std::runtime_error("no scratch directory");
-    return root;
-  }
   void makeHome(const std::string& devicePath, uid_t owner) const {
     std::filesystem::create_directories(path(devicePath));
     // Without root's rights everything belongs to the tester, which is as good.
@@ -198,7 +194,7 @@ class ContainerDevice {
     personas_.setList(std::move(list));
   }
 
-  const std::string root_ = makeRoot();
+  const std::string root_ = makeScratchDirectory(testing::TempDir());
   FakePersonas personas_;
   std::unique_ptr<platform::DevicePlatform> device_;
   std::unique_ptr<platform::Platform> current_;

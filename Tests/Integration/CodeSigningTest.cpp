@@ -46,11 +46,6 @@ Dictionary informationNaming(const Groups& groups, int version = 1) {
           {"Version", version}};
 }
 
-template <typename T>
-uint64_t codeOf(const tessary::Result<T>& result) {
-  return result ? uint64_t{kDone} : result.error().code;
-}
-
 class CodeSigning : public ::testing::Test {
  protected:
   void SetUp() override {
@@ -286,9 +281,7 @@ TEST_F(CodeSigning, ADatabaseThatCannotBeUsedEndsTheStart) {
     EXPECT_EQ(waitForExit(daemon), EXIT_FAILURE);
     EXPECT_EQ(serviceManager.take(), "") << "it was never ready";
     if (::access("/run/systemd/journal/socket", W_OK) == 0) return;
-    std::ifstream stream(log);
-    const std::string text{std::istreambuf_iterator<char>(stream), {}};
-    EXPECT_NE(text.find(words), std::string::npos) << text;
+    EXPECT_NE(contentOf(log).find(words), std::string::npos) << contentOf(log);
   };
   std::filesystem::create_directories(database);
   expectFailedStart("Failed to open database, err = 14");

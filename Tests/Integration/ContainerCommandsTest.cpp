@@ -36,11 +36,6 @@ constexpr char kApplication[] = "com.example.app";
 const Creation kRegular{2, kApplication};
 const Creation kTransient{2, kApplication, /*transient=*/true};
 
-template <typename T>
-uint64_t codeOf(const tessary::Result<T>& result) {
-  return result ? kSuccess : result.error().code;
-}
-
 ContainerName nameOf(const Container& container, uint64_t containerClass) {
   return {container.identifier, containerClass, container.uuid, container.personaUniqueString};
 }

@@ -3,6 +3,7 @@
 #include <fmt/format.h>
 #include <sys/stat.h>
 #include <sys/xattr.h>
+#include <unistd.h>
 
 #include <array>
 #include <filesystem>
@@ -12,6 +13,7 @@
 #include "Platform/values/PropertyList.h"
 #include "Platform/values/UUID.h"
 #include "Tests/Integration/Subprocess.h"
+#include "Tests/ScratchDirectory.h"
 
 using platform::UUID;
 using platform::Value;
@@ -79,8 +81,8 @@ tessary::Result<tessary::Container> Creation::lookUp(tessary::Client& client) co
 }
 
 std::string quickParent() {
-  std::string probe = "/dev/shm/tessary-probe-XXXXXX";
-  if (::mkdtemp(probe.data()) == nullptr) return {};
+  if (::access("/dev/shm", W_OK) != 0) return {};
+  const std::string probe = makeScratchDirectory("/dev/shm");
   const bool isFit =
       ::setxattr(probe.c_str(), "trusted.tessary.probe", "", 0, 0) == 0 &&
       (::getxattr(probe.c_str(), "system.posix_acl_default", nullptr, 0) >= 0 || errno == ENODATA);

@@ -2,16 +2,18 @@
 
 #include <gtest/gtest.h>
 #include <signal.h>
+#include <sys/mount.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <filesystem>
 #include <fstream>
-#include <iterator>
+#include <sstream>
 
 #include "Platform/os/Tasks.h"
 #include "Platform/values/PropertyList.h"
 #include "Tests/Integration/Subprocess.h"
+#include "Tests/ScratchDirectory.h"
 
 using platform::FileSystem;
 using platform::Value;
@@ -20,9 +22,11 @@ namespace {
 
 constexpr char kPrefix[] = "com.veltra.private.Tessary.";
 
-std::string contentOf(const std::string& path) {
-  std::ifstream file(path);
-  return {std::istreambuf_iterator<char>(file), {}};
+void unmountBelow(const std::string& root) {
+  std::ifstream mounts("/proc/self/mounts");
+  for (std::string source, place, rest; mounts >> source >> place && std::getline(mounts, rest);) {
+    if (place.starts_with(root + "/")) ::umount2(place.c_str(), MNT_DETACH);
+  }
 }
 
 void writePropertyList(const std::string& path, const Value& value) {
@@ -54,6 +58,12 @@ Caller privilegedCaller() {
   return caller.with("allowed");
 }
 
+std::string contentOf(const std::string& path) {
+  std::ostringstream content;
+  content << std::ifstream(path, std::ios::binary).rdbuf();
+  return content.str();
+}
+
 std::string Answer::text(const char* key) const {
   return json.is_object() && json.contains(key) ? json.at(key).get<std::string>() : std::string();
 }
@@ -63,12 +73,8 @@ std::string Device::program(const std::string& name) {
 }
 
 Device::Device(const std::string& parent, const std::string& user) {
-  std::string pattern =
-      (parent.empty() ? std::filesystem::temp_directory_path().string() : parent) +
-      "/tessary-device-XXXXXX";
-  if (::mkdtemp(pattern.data()) == nullptr) throw std::runtime_error("mkdtemp " + pattern);
-  if (::chmod(pattern.c_str(), 0755) != 0) throw std::runtime_error("chmod " + pattern);
-  root_ = std::filesystem::canonical(pattern).string();
+  root_ = parent.empty() ? makeScratchDirectory() : makeScratchDirectory(parent);
+  if (::chmod(root_.c_str(), 0755) != 0) throw std::runtime_error("chmod " + root_);
   std::vector<std::string> command = {program("tessary-platform"), "--root", root_, "init"};
   if (!user.empty()) command.insert(command.end(), {"--user", user});
   const Finished prepared = runToEnd(command);
@@ -78,6 +84,7 @@ Device::Device(const std::string& parent, const std::string& user) {
 
 Device::~Device() {
   kill();
+  unmountBelow(root_);
   std::error_code ignored;
   std::filesystem::remove_all(root_, ignored);
 }

@@ -28,6 +28,15 @@ struct Caller {
   Caller with(const std::string& name, platform::Value value = true) const;
 };
 
+// What a call comes to, as the daemon says it: 1 for success.
+template <typename T>
+uint64_t codeOf(const tessary::Result<T>& result) {
+  return result ? uint64_t{1} : result.error().code;
+}
+
+// The content of a file; empty for what is no file.
+std::string contentOf(const std::string& path);
+
 // What tessaryctl answered: its JSON, or the daemon's code.
 struct Answer {
   uint64_t code = 0;  // 1 for success; 0 when the daemon could not be asked

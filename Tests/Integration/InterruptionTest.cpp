@@ -116,11 +116,6 @@ size_t strideOver(const std::vector<FileCall>& calls) {
   return calls.size() < kManyCalls ? 1 : kSanitizedStride;
 }
 
-std::string contentOf(const std::string& file) {
-  std::ifstream stream(file, std::ios::binary);
-  return {std::istreambuf_iterator<char>(stream), {}};
-}
-
 class Interruption : public ::testing::TestWithParam<Operation> {
  protected:
   void SetUp() override {

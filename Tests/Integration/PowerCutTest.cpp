@@ -23,6 +23,7 @@
 #include "Tests/Integration/SanitizedBuild.h"
 #include "Tests/Integration/Subprocess.h"
 #include "Tests/Integration/SystemCalls.h"
+#include "Tests/ScratchDirectory.h"
 
 namespace {
 
@@ -37,10 +38,8 @@ constexpr uint64_t kNotFound = 21;
 class Disk {
  public:
   Disk() {
-    std::string pattern =
-        (quickParent().empty() ? std::filesystem::temp_directory_path().string() : quickParent()) +
-        "/tessary-disk-XXXXXX";
-    directory_ = ::mkdtemp(pattern.data());
+    const std::string parent = quickParent();
+    directory_ = parent.empty() ? makeScratchDirectory() : makeScratchDirectory(parent);
     std::filesystem::create_directory(mountPoint());
     const Finished made =
         runToEnd({"/bin/sh", "-c", "truncate -s 64M \"$0\" && /usr/sbin/mkfs.ext4 -q -F \"$0\"",

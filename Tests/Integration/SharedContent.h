@@ -8,7 +8,6 @@
 
 #include <filesystem>
 #include <fstream>
-#include <sstream>
 
 #include "Tests/Integration/ContainerState.h"
 
@@ -31,12 +30,6 @@ inline constexpr uid_t kMobile = 501;
 inline constexpr char kApplication[] = "com.example.app";
 inline constexpr char kGroup[] = "systemgroup.com.example.shared";
 inline constexpr char kAssetsPrefix[] = "com.veltra.UserManagedAssets.";
-
-inline std::string contentOf(const std::string& path) {
-  std::ostringstream content;
-  content << std::ifstream(path, std::ios::binary).rdbuf();
-  return content.str();
-}
 
 inline void write(const std::string& path, const std::string& text = "content") {
   std::filesystem::create_directories(std::filesystem::path(path).parent_path());
@@ -69,10 +62,6 @@ class SharedContent : public ::testing::Test {
     return made ? made->path : std::string();
   }
 
-  template <typename T>
-  static uint64_t codeOf(const tessary::Result<T>& result) {
-    return result ? uint64_t{kDone} : result.error().code;
-  }
   static tessary::Result<tessary::UserManagedAssets> assets(
       tessary::Client& client, bool create, const std::string& identifier = kApplication) {
     return client.userManagedAssetsPath(identifier, {.createIfNecessary = create});

@@ -15,14 +15,14 @@
 #include <string>
 
 #include "Platform/fs/FileSystem.h"
+#include "Tests/ScratchDirectory.h"
 
 namespace platform {
 
 class Scratch {
  public:
   explicit Scratch(Privilege privilege = ::geteuid() == 0 ? Privilege::root : Privilege::none) {
-    std::string name = std::filesystem::canonical(testing::TempDir()).string() + "/fs.XXXXXX";
-    outside_ = ::mkdtemp(name.data());
+    outside_ = makeScratchDirectory(testing::TempDir());
     std::filesystem::create_directory(outside_ + "/root");
     open(privilege);
   }

@@ -12,14 +12,14 @@
 #include "Platform/fs/FileSystem.h"
 #include "Platform/os/RuntimeDirectory.h"
 #include "Platform/values/PropertyList.h"
+#include "Tests/ScratchDirectory.h"
 
 namespace platform {
 
 class TestRoot {
  public:
   TestRoot() {
-    std::string name = std::filesystem::temp_directory_path() / "tessary-os-XXXXXX";
-    path_ = std::filesystem::canonical(::mkdtemp(name.data()));
+    path_ = makeScratchDirectory();
     const Privilege privilege = ::geteuid() == 0 ? Privilege::root : Privilege::none;
     files_ = std::move(FileSystem::open(path_, privilege).value());
     EXPECT_TRUE(prepareRuntimeDirectory(*files_));
